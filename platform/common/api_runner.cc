@@ -1,0 +1,127 @@
+// The registry of in-process web APIs and the in-process call.
+
+#include <map>
+#include <mutex>
+#include <string>
+#include <tuple>
+
+#include "kova/webapi.h"
+
+namespace KOVA {
+namespace {
+
+using MethodKey = std::tuple<std::string, int, std::string>;
+
+struct Method {
+  APIHandler handler = nullptr;
+  APICheck check = nullptr;
+};
+
+struct Registry {
+  std::mutex mutex;
+  std::map<MethodKey, Method> methods;
+};
+
+Registry& TheRegistry() {
+  static Registry registry;
+  return registry;
+}
+
+// The registered method, or the host error that says why there is none.
+int Find(const MethodKey& key, Method& found) {
+  Registry& registry = TheRegistry();
+  std::lock_guard lock(registry.mutex);
+  auto it = registry.methods.find(key);
+  if (it != registry.methods.end()) {
+    found = it->second;
+    return 0;
+  }
+  const auto& [api, version, method] = key;
+  bool api_known = false;
+  bool version_known = false;
+  for (const auto& [other, unused] : registry.methods) {
+    api_known = api_known || std::get<0>(other) == api;
+    version_known = version_known || (std::get<0>(other) == api && std::get<1>(other) == version);
+  }
+  if (!api_known) return kAPIErrorNoSuchAPI;
+  return version_known ? kAPIErrorNoSuchMethod : kAPIErrorBadVersion;
+}
+
+Json::Value Failure(int code, const Json::Value& errors) {
+  Json::Value out;
+  out["success"] = false;
+  out["error"]["code"] = code;
+  if (!errors.isNull()) out["error"]["errors"] = errors;
+  return out;
+}
+
+Json::Value Answer(const APIResponse& response) {
+  if (!response.IsOutputEnabled() || response.GetState() == APIResponse::State::kUnset) {
+    return Failure(kAPIErrorUnknown, Json::Value());
+  }
+  if (response.GetState() == APIResponse::State::kError) {
+    return Failure(response.GetErrorCode(), response.GetData());
+  }
+  Json::Value out;
+  out["success"] = true;
+  if (!response.GetData().isNull()) out["data"] = response.GetData();
+  return out;
+}
+
+}  // namespace
+
+int APIRunner::Exec(Json::Value& out, const char* api, int version, const char* method,
+                    const Json::Value& params, const char* user) {
+  Method found;
+  const int missing = Find({api ? api : "", version, method ? method : ""}, found);
+  if (missing != 0) {
+    out = Failure(missing, Json::Value());
+    return -1;
+  }
+  APIRequest request(params, user ? user : "", "enu");
+  APIResponse response;
+  try {
+    if (found.check != nullptr && found.check(&request) == 0) {
+      out = Failure(kAPIErrorNotPermitted, Json::Value());
+      return 0;
+    }
+    found.handler(&request, &response);
+    out = Answer(response);
+  } catch (...) {
+    out = Failure(kAPIErrorUnknown, Json::Value());
+  }
+  return 0;
+}
+
+int APIRunner::Register(const APITableEntry* table, const APICheckEntry* checks) {
+  std::map<MethodKey, Method> added;
+  for (const APITableEntry* row = table; row != nullptr && row->api != nullptr; ++row) {
+    if (row->handler == nullptr || row->method == nullptr) return -1;
+    MethodKey key{row->api, static_cast<int>(row->version), row->method};
+    if (!added.emplace(key, Method{row->handler, nullptr}).second) return -1;
+  }
+  for (const APICheckEntry* row = checks; row != nullptr && row->api != nullptr; ++row) {
+    auto it =
+        added.find({row->api, static_cast<int>(row->version), row->method ? row->method : ""});
+    if (it != added.end()) it->second.check = row->check;
+  }
+  Registry& registry = TheRegistry();
+  std::lock_guard lock(registry.mutex);
+  for (const auto& [key, unused] : added) {
+    if (registry.methods.count(key) != 0) return -1;
+  }
+  const int count = static_cast<int>(added.size());
+  registry.methods.merge(added);
+  return count;
+}
+
+void APIRunner::Unregister(const APITableEntry* table) {
+  Registry& registry = TheRegistry();
+  std::lock_guard lock(registry.mutex);
+  for (const APITableEntry* row = table; row != nullptr && row->api != nullptr; ++row) {
+    registry.methods.erase(
+        {row->api, static_cast<int>(row->version), row->method ? row->method : ""});
+  }
+}
+
+}  // namespace KOVA

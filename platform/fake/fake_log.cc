@@ -1,0 +1,132 @@
+// The test platform's logs: the performance-event log as a list of lines, and
+// syslog(3) captured in memory.
+
+#include <stdarg.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <fstream>
+
+#include "fake/fake_state.h"
+#include "kova/error.h"
+#include "kova/log.h"
+
+namespace kova_fake {
+namespace {
+
+// A directory of this process for the log's file, removed when the process ends.
+class LogDirectory {
+ public:
+  LogDirectory() {
+    char pattern[] = "/tmp/kova_fake.XXXXXX";
+    if (mkdtemp(pattern) != nullptr) path_ = pattern;
+    file_ = path_ + "/perfevent.log";
+  }
+  ~LogDirectory() {
+    if (getpid() != owner_) return;
+    unlink(file_.c_str());
+    rmdir(path_.c_str());
+  }
+  const std::string& file() const { return file_; }
+
+ private:
+  pid_t owner_ = getpid();
+  std::string path_;
+  std::string file_;
+};
+
+}  // namespace
+
+const std::string& LogFilePath() {
+  static LogDirectory directory;
+  return directory.file();
+}
+
+void SyncLogFile() {
+  if (TheState().log_lines) {
+    std::ofstream(LogFilePath(), std::ios::app);
+  } else {
+    unlink(LogFilePath().c_str());
+  }
+}
+
+void SetLogLines(const std::vector<std::string>& lines) {
+  TheState().log_lines = lines;
+  SyncLogFile();
+}
+
+void FailLogFetch(bool fail) { TheState().log_fetch_fails = fail; }
+
+}  // namespace kova_fake
+
+using kova_fake::Record;
+using kova_fake::TheState;
+
+int KOVALogFilePathGet(int type, char* path, size_t size) {
+  const std::string& file = kova_fake::LogFilePath();
+  if (type != kLogTypePerfEvent || file.size() >= size) return -1;
+  snprintf(path, size, "%s", file.c_str());
+  return 0;
+}
+
+int KOVALogGet1(int type, const char* out_path, const char* language) {
+  Record("KOVALogGet1 " + std::to_string(type) + " " + language);
+  if (type != kLogTypePerfEvent || TheState().log_fetch_fails) return -1;
+  std::ofstream out(out_path, std::ios::trunc);
+  for (const std::string& line : TheState().log_lines.value_or(std::vector<std::string>())) {
+    out << line << '\n';
+  }
+  return out ? 0 : -1;
+}
+
+int KOVALogClean(int type) {
+  Record("KOVALogClean " + std::to_string(type));
+  if (type != kLogTypePerfEvent) return -1;
+  if (TheState().log_lines) TheState().log_lines->clear();
+  return 0;
+}
+
+int KOVALogWrite(int type, const char* level, const char* user, const char* source,
+                 const char* event) {
+  if (type != kLogTypePerfEvent) return -1;
+  auto& lines = TheState().log_lines;
+  if (!lines) lines.emplace();
+  lines->push_back(std::to_string(lines->size() + 1) + "\t" + level + "\t" +
+                   KOVALogConvertTime1(time(nullptr)) + "\t" + user + "\t" + source + "\t" + event);
+  kova_fake::SyncLogFile();
+  return 0;
+}
+
+namespace {
+
+void CaptureSyslog(int priority, const char* format, va_list args) {
+  char text[4096];
+  vsnprintf(text, sizeof(text), format, args);
+  TheState().syslog.push_back({priority, text});
+}
+
+}  // namespace
+
+// syslog(3) and its fortified form, interposed on the C library's so that tests
+// can read what was logged.
+#pragma GCC visibility push(default)
+extern "C" {
+
+void syslog(int priority, const char* format, ...) {
+  va_list args;
+  va_start(args, format);
+  CaptureSyslog(priority, format, args);
+  va_end(args);
+}
+
+void __syslog_chk(int priority, int, const char* format, ...) {
+  va_list args;
+  va_start(args, format);
+  CaptureSyslog(priority, format, args);
+  va_end(args);
+}
+
+}  // extern "C"
+#pragma GCC visibility pop

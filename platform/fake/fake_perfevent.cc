@@ -1,0 +1,104 @@
+// The test platform's rule store: rules in memory, lists allocated per call and
+// counted until freed.
+
+#include <cstdio>
+#include <cstring>
+
+#include "fake/fake_state.h"
+#include "kova/error.h"
+#include "kova/perfevent.h"
+
+namespace kova_fake {
+
+void FailRuleWrite(int error) { TheState().rule_write_error = error; }
+
+std::vector<KOVAPERFEVENT_CONF_SETTING> Rules() { return TheState().rules; }
+
+int OpenRuleLists() { return TheState().open_rule_lists; }
+
+namespace {
+
+KOVAPERFEVENT_CONF_SETTING* FindRule(const char* id) {
+  for (auto& rule : TheState().rules) {
+    if (id != nullptr && strcmp(rule.id, id) == 0) return &rule;
+  }
+  return nullptr;
+}
+
+// Fails a write as arranged by FailRuleWrite.
+bool WriteFails() {
+  if (TheState().rule_write_error == 0) return false;
+  KOVA_SET_ERROR(TheState().rule_write_error);
+  return true;
+}
+
+}  // namespace
+}  // namespace kova_fake
+
+using kova_fake::Record;
+using kova_fake::TheState;
+
+KovaPerfEventConfSettingNode* KOVAPerfEventConfListGet(const char* id) {
+  std::vector<KOVAPERFEVENT_CONF_SETTING> found;
+  if (id == nullptr) {
+    found = TheState().rules;
+  } else if (const KOVAPERFEVENT_CONF_SETTING* rule = kova_fake::FindRule(id)) {
+    found.push_back(*rule);
+  } else {
+    return nullptr;
+  }
+  // An empty store answers a head without a record.
+  auto* head = new KovaPerfEventConfSettingNode{nullptr, nullptr};
+  KovaPerfEventConfSettingNode* tail = head;
+  for (size_t i = 0; i < found.size(); ++i) {
+    if (i > 0) tail = tail->next = new KovaPerfEventConfSettingNode{nullptr, nullptr};
+    tail->setting = new KOVAPERFEVENT_CONF_SETTING(found[i]);
+  }
+  ++TheState().open_rule_lists;
+  return head;
+}
+
+void KOVAPerfEventConfListFree(KovaPerfEventConfSettingNode* head) {
+  if (head == nullptr) return;
+  --TheState().open_rule_lists;
+  while (head != nullptr) {
+    KovaPerfEventConfSettingNode* next = head->next;
+    delete head->setting;
+    delete head;
+    head = next;
+  }
+}
+
+int KOVAPerfEventIsConfExisted(const char* id) { return kova_fake::FindRule(id) != nullptr; }
+
+int KOVAPerfEventConfAdd(KOVAPERFEVENT_CONF_SETTING* setting) {
+  Record("KOVAPerfEventConfAdd");
+  if (kova_fake::WriteFails()) return -1;
+  snprintf(setting->id, sizeof(setting->id), "%d", TheState().next_rule_id++);
+  TheState().rules.push_back(*setting);
+  return 0;
+}
+
+int KOVAPerfEventConfSet(const KOVAPERFEVENT_CONF_SETTING* setting) {
+  Record(std::string("KOVAPerfEventConfSet ") + setting->id);
+  if (kova_fake::WriteFails()) return -1;
+  KOVAPERFEVENT_CONF_SETTING* stored = kova_fake::FindRule(setting->id);
+  if (stored == nullptr) {
+    KOVA_SET_ERROR(KOVA_ERR_NOT_FOUND);
+    return -1;
+  }
+  *stored = *setting;
+  return 0;
+}
+
+int KOVAPerfEventConfDelete(const char* id) {
+  Record(std::string("KOVAPerfEventConfDelete ") + id);
+  auto& rules = TheState().rules;
+  for (auto it = rules.begin(); it != rules.end(); ++it) {
+    if (strcmp(it->id, id) == 0) {
+      rules.erase(it);
+      return 0;
+    }
+  }
+  return -1;
+}

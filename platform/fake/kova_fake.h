@@ -17,68 +17,70 @@
 #include "kova/perfevent.h"
 
 // The whole control API is exported from the fake library.
-namespace kova_fake __attribute__((visibility("default"))) {
+#pragma GCC visibility push(default)
+namespace kova_fake {
 
-  // Forgets everything arranged and recorded; the registry of in-process web APIs
-  // is the common platform's and is not touched.
-  void Reset();
+// Forgets everything arranged and recorded; the registry of in-process web APIs
+// is the common platform's and is not touched.
+void Reset();
 
-  // Configuration files.
-  void SetConf(const std::string& file, const std::string& key, const std::string& value);
-  std::optional<std::string> GetConf(const std::string& file, const std::string& key);
-  // Reads of `key` in `file` (of every key when `key` is empty) return `result` (negative).
-  void FailConfRead(const std::string& file, int result, const std::string& key = "");
-  // Every write of `key` into the system settings file returns `result` (negative).
-  void FailConfWrite(const std::string& key, int result);
+// Configuration files.
+void SetConf(const std::string& file, const std::string& key, const std::string& value);
+std::optional<std::string> GetConf(const std::string& file, const std::string& key);
+// Reads of `key` in `file` (of every key when `key` is empty) return `result` (negative).
+void FailConfRead(const std::string& file, int result, const std::string& key = "");
+// Every write of `key` into the system settings file returns `result` (negative).
+void FailConfWrite(const std::string& key, int result);
 
-  // Services: running state, display names, and failures of an operation
-  // ("start", "stop" or "reload") with `result`.
-  void SetServiceRunning(const std::string& name, bool running);
-  void SetServiceDisplayName(const std::string& name, const std::string& display);
-  void FailService(const std::string& name, const std::string& operation, int result);
+// Services: running state, display names, and failures of an operation
+// ("start", "stop" or "reload") with `result`.
+void SetServiceRunning(const std::string& name, bool running);
+void SetServiceDisplayName(const std::string& name, const std::string& display);
+void FailService(const std::string& name, const std::string& operation, int result);
 
-  // Shared folders: what KOVAShareServiceVolumeGetbyLink answers for `link`
-  // (0, not found, unless set).
-  void SetVolumeLookup(const std::string& link, int result, const std::string& volume);
+// Shared folders: what KOVAShareServiceVolumeGetbyLink answers for `link`
+// (0, not found, unless set).
+void SetVolumeLookup(const std::string& link, int result, const std::string& volume);
 
-  // The statistics service: each Transmitor exchange takes the next queued one.
-  // With none queued, Transmit fails as if the service were absent.
-  struct Exchange {
-    int transmit_result = 0;
-    int get_result = 0;
-    Json::Value reply;
-  };
-  void QueueExchange(const Exchange& exchange);
+// The statistics service: each Transmitor exchange takes the next queued one.
+// With none queued, Transmit fails as if the service were absent.
+struct Exchange {
+  int transmit_result = 0;
+  int get_result = 0;
+  Json::Value reply;
+};
+void QueueExchange(const Exchange& exchange);
 
-  // Localised texts, looked up when StringBundle::Text is called.
-  void SetText(const std::string& section, const std::string& key, const std::string& text);
+// Localised texts, looked up when StringBundle::Text is called.
+void SetText(const std::string& section, const std::string& key, const std::string& text);
 
-  // The performance-event log: whether its file exists, the lines a fetch writes,
-  // and a fetch that fails. KOVALogWrite appends a line.
-  void SetLogLines(const std::vector<std::string>& lines);
-  void FailLogFetch(bool fail);
-  // Paths handed out by QLIBCFileITmpName.
-  const std::vector<std::string>& TempFiles();
+// The performance-event log: whether its file exists, the lines a fetch writes,
+// and a fetch that fails. KOVALogWrite appends a line.
+void SetLogLines(const std::vector<std::string>& lines);
+void FailLogFetch(bool fail);
+// Paths handed out by QLIBCFileITmpName.
+const std::vector<std::string>& TempFiles();
 
-  // The rule store. Ids are assigned "1", "2", ... on add. A failing add or set
-  // returns -1 with `error` as the last platform error.
-  void FailRuleWrite(int error);
-  std::vector<KOVAPERFEVENT_CONF_SETTING> Rules();
-  // Lists handed out by KOVAPerfEventConfListGet and not yet freed.
-  int OpenRuleLists();
+// The rule store. Ids are assigned "1", "2", ... on add. A failing add or set
+// returns -1 with `error` as the last platform error.
+void FailRuleWrite(int error);
+std::vector<KOVAPERFEVENT_CONF_SETTING> Rules();
+// Lists handed out by KOVAPerfEventConfListGet and not yet freed.
+int OpenRuleLists();
 
-  // Platform calls that read or change state, one line each, such as
-  // "QLIBCINFOSetKeyValue resourcemonitor_history=yes" or "QLIBServiceStart kovaperfeventd".
-  const std::vector<std::string>& Calls();
+// Platform calls that read or change state, one line each, such as
+// "QLIBCINFOSetKeyValue resourcemonitor_history=yes" or "QLIBServiceStart kovaperfeventd".
+const std::vector<std::string>& Calls();
 
-  // Lines written with syslog(3), with their priority (facility and level).
-  struct SyslogLine {
-    int priority;
-    std::string text;
-    bool operator==(const SyslogLine&) const = default;
-  };
-  const std::vector<SyslogLine>& Syslog();
+// Lines written with syslog(3), with their priority (facility and level).
+struct SyslogLine {
+  int priority;
+  std::string text;
+  bool operator==(const SyslogLine&) const = default;
+};
+const std::vector<SyslogLine>& Syslog();
 
-}  // namespace )
+}  // namespace kova_fake
+#pragma GCC visibility pop
 
 #endif  // KOVA_FAKE_KOVA_FAKE_H_

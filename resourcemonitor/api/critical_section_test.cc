@@ -110,6 +110,14 @@ TEST_F(CriticalSectionTest, LogsAndGoesOnWhenTheProcessCannotRaise) {
     EXPECT_THAT(kova_fake::Syslog(),
                 ElementsAre(Error("log:5 ERROR: setresgid(-1, 0, -1) [Operation not permitted]"),
                             Error("log:5 ERROR: LEAVECriticalSection")));
+
+    // Nor can it take the user id to 0 to begin with.
+    kova_fake::Reset();
+    LEAVECriticalSection(CriticalSection{0, kNobody}, "log", 6);
+    EXPECT_EQ(errno, 1);
+    EXPECT_THAT(kova_fake::Syslog(),
+                ElementsAre(Error("log:6 ERROR: setresuid(-1, 0, -1) [Operation not permitted]"),
+                            Error("log:6 ERROR: LEAVECriticalSection")));
   }));
 }
 

@@ -132,6 +132,10 @@ TEST_F(SettingTest, FailuresCarryOverWhatTheyDoNotOverwrite) {
   kova_fake::FailConfWrite("resourcemonitor_realtime_max", -1);
   ExpectError(CallHandler(set_v1, R"({"duration": 60})"), 6101, 68, "Get Conf Failed", "error",
               "db_connect_fail");
+
+  kova_fake::SetVolumeLookup("pgsql", 0, "");
+  ExpectError(CallHandler(set_v1, R"({"enable_history": true})"), 6103, 139, "Not Found Volumes.",
+              "error", "volume_no_volumes");
 }
 
 TEST_F(SettingTest, SetRejectsParametersOfTheWrongJsonType) {
@@ -188,7 +192,10 @@ TEST_F(SettingTest, SetAppliesItsStepsInOrder) {
     std::vector<std::string> calls;
   } cases[] = {
       {"yes", true, "{}", {}},
-      {"yes", true, R"({"enable_history": true})", {kAskDatabase, kReadHistory}},
+      {"yes",
+       true,
+       R"({"enable_history": true, "enable_event": true})",
+       {kAskDatabase, kReadHistory, kEventOn, kStart}},
       {std::nullopt, true, R"({"enable_history": false})", {kReadHistory}},
       {"yes", false, R"({"enable_history": false})", {kReadHistory, kHistoryOff, kReload}},
       {"Yes",

@@ -1,13 +1,14 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <json/reader.h>
-#include <json/writer.h>
 
 #include <stdexcept>
 
+#include "fake/host_call.h"
 #include "kova/webapi.h"
 
 namespace {
+
+using kova_fake::ParseJson;
 
 void Echo(KOVA::APIRequest* request, KOVA::APIResponse* response) {
   Json::Value data;
@@ -35,14 +36,6 @@ APICheckEntry kChecks[] = {
     {"Test.Echo", 1, "denied", Deny, 0, 0},
     {nullptr, 0, nullptr, nullptr, 0, 0},
 };
-
-Json::Value Parse(const std::string& text) {
-  Json::Value value;
-  std::string errors;
-  std::unique_ptr<Json::CharReader>(Json::CharReaderBuilder().newCharReader())
-      ->parse(text.data(), text.data() + text.size(), &value, &errors);
-  return value;
-}
 
 class APIRunnerTest : public ::testing::Test {
  protected:
@@ -72,10 +65,11 @@ TEST_F(APIRunnerTest, AnswersInTheEnvelopeOfTheWebAPI) {
   };
   for (const auto& c : cases) {
     Json::Value out;
-    EXPECT_EQ(KOVA::APIRunner::Exec(out, c.api, c.version, c.method, Parse(R"({"n": 7})"), "admin"),
-              c.result)
+    EXPECT_EQ(
+        KOVA::APIRunner::Exec(out, c.api, c.version, c.method, ParseJson(R"({"n": 7})"), "admin"),
+        c.result)
         << c.method;
-    EXPECT_EQ(out, Parse(c.out)) << c.api << " v" << c.version << " " << c.method;
+    EXPECT_EQ(out, ParseJson(c.out)) << c.api << " v" << c.version << " " << c.method;
   }
 }
 

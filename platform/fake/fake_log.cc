@@ -2,6 +2,7 @@
 // syslog(3) captured in memory.
 
 #include <stdarg.h>
+#include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
 
@@ -21,7 +22,9 @@ class LogDirectory {
  public:
   LogDirectory() {
     char pattern[] = "/tmp/kova_fake.XXXXXX";
-    if (mkdtemp(pattern) != nullptr) path_ = pattern;
+    // Searchable by all, as a system log's directory is, so that an existence
+    // test works with lowered effective ids.
+    if (mkdtemp(pattern) != nullptr && chmod(pattern, 0755) == 0) path_ = pattern;
     file_ = path_ + "/perfevent.log";
   }
   ~LogDirectory() {
@@ -59,6 +62,15 @@ void SetLogLines(const std::vector<std::string>& lines) {
 
 void FailLogFetch(bool fail) { TheState().log_fetch_fails = fail; }
 
+void FailLogPath(bool fail) { TheState().log_path_fails = fail; }
+
+namespace {
+
+// Records a call on the log with the effective user id it ran under.
+void RecordLogCall(const std::string& call) { Record(call + " euid=" + std::to_string(geteuid())); }
+
+}  // namespace
+
 }  // namespace kova_fake
 
 using kova_fake::Record;
@@ -66,13 +78,13 @@ using kova_fake::TheState;
 
 int KOVALogFilePathGet(int type, char* path, size_t size) {
   const std::string& file = kova_fake::LogFilePath();
-  if (type != kLogTypePerfEvent || file.size() >= size) return -1;
+  if (type != kLogTypePerfEvent || file.size() >= size || TheState().log_path_fails) return -1;
   snprintf(path, size, "%s", file.c_str());
   return 0;
 }
 
 int KOVALogGet1(int type, const char* out_path, const char* language) {
-  Record("KOVALogGet1 " + std::to_string(type) + " " + language);
+  kova_fake::RecordLogCall("KOVALogGet1 " + std::to_string(type) + " " + language);
   if (type != kLogTypePerfEvent || TheState().log_fetch_fails) return -1;
   std::ofstream out(out_path, std::ios::trunc);
   for (const std::string& line : TheState().log_lines.value_or(std::vector<std::string>())) {
@@ -82,7 +94,7 @@ int KOVALogGet1(int type, const char* out_path, const char* language) {
 }
 
 int KOVALogClean(int type) {
-  Record("KOVALogClean " + std::to_string(type));
+  kova_fake::RecordLogCall("KOVALogClean " + std::to_string(type));
   if (type != kLogTypePerfEvent) return -1;
   if (TheState().log_lines) TheState().log_lines->clear();
   return 0;

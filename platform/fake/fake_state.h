@@ -28,6 +28,7 @@ struct State {
   std::map<std::string, std::map<std::string, std::string>> texts;  // section -> key -> text
   std::optional<std::vector<std::string>> log_lines;                // absent: no log file
   bool log_fetch_fails = false;
+  bool log_path_fails = false;
   std::vector<std::string> temp_files;
   std::vector<KOVAPERFEVENT_CONF_SETTING> rules;
   int next_rule_id = 1;

@@ -54,10 +54,13 @@ void QueueExchange(const Exchange& exchange);
 // Localised texts, looked up when StringBundle::Text is called.
 void SetText(const std::string& section, const std::string& key, const std::string& text);
 
-// The performance-event log: whether its file exists, the lines a fetch writes,
-// and a fetch that fails. KOVALogWrite appends a line.
+// The performance-event log: whether its file exists, the lines a fetch writes
+// (each followed by a line feed), a fetch that fails and a path lookup that
+// fails. KOVALogWrite appends a line. Fetch and clean are recorded with the
+// effective user id they ran under, as in "KOVALogClean 18 euid=0".
 void SetLogLines(const std::vector<std::string>& lines);
 void FailLogFetch(bool fail);
+void FailLogPath(bool fail);
 // Paths handed out by QLIBCFileITmpName.
 const std::vector<std::string>& TempFiles();
 

@@ -1,15 +1,62 @@
-// The event log is not served yet: its methods answer that they are not available.
-
 #include "log/log.h"
+
+#include <vector>
+
+#include "api/critical_section.h"
+#include "api/error_report.h"
+#include "kova/log.h"
+#include "log/log_reader.h"
 
 namespace {
 
-void NotAvailable(KOVA::APIResponse* response) {
-  response->SetError(KOVA::kAPIErrorNoSuchMethod, Json::Value());
+constexpr char kSource[] = "log";
+
+// Reads "offset", "limit" and "filter" into `filter`. False when one of them
+// can't be read as what it stands for, or the filter's level is not acceptable.
+bool ParseListRequest(const KOVA::APIRequest& request, LogFilter& filter) {
+  const Json::Value offset = request.GetParam("offset", Json::Value(0));
+  const Json::Value limit = request.GetParam("limit", Json::Value(-1));
+  if (!offset.isConvertibleTo(Json::intValue) || !limit.isConvertibleTo(Json::intValue)) {
+    return false;
+  }
+  return ParseLogFilter(request.GetParam("filter", Json::Value()), offset.asInt(), limit.asInt(),
+                        filter);
+}
+
+// The page of `entries` that starts at `offset` and holds at most `limit`
+// entries (all when negative). The entries are moved into it.
+Json::Value TakePage(std::vector<Json::Value>& entries, int offset, int limit) {
+  Json::Value logs(Json::arrayValue);
+  if (offset < 0 || limit == 0) return logs;
+  for (size_t i = static_cast<size_t>(offset); i < entries.size(); ++i) {
+    if (limit > 0 && logs.size() == static_cast<unsigned>(limit)) break;
+    logs.append(std::move(entries[i]));
+  }
+  return logs;
 }
 
 }  // namespace
 
-void log_list_v1(KOVA::APIRequest*, KOVA::APIResponse* response) { NotAvailable(response); }
-void log_clear_v1(KOVA::APIRequest*, KOVA::APIResponse* response) { NotAvailable(response); }
-void log_export_v1(KOVA::APIRequest*, KOVA::APIResponse* response) { NotAvailable(response); }
+void log_list_v1(KOVA::APIRequest* request, KOVA::APIResponse* response) {
+  LogFilter filter;
+  if (!ParseListRequest(*request, filter)) {
+    return response->SetError(kErrorBadParameter, Json::Value());
+  }
+  std::vector<Json::Value> entries;
+  const bool read = ProcessLog(filter, entries);
+  Json::Value reply;
+  reply["total"] = static_cast<Json::UInt>(entries.size());
+  reply["logs"] = TakePage(entries, filter.offset, filter.limit);
+  // An unreadable log is answered with the error record as it stands, beside
+  // the empty page.
+  if (!read) return SetErrorFromReport(response, reply);
+  response->SetSuccess(reply);
+}
+
+void log_clear_v1(KOVA::APIRequest*, KOVA::APIResponse* response) {
+  CriticalSection section;
+  ENTERCriticalSection(section, kSource, __LINE__);
+  KOVALogClean(kLogTypePerfEvent);  // the clear reports success whatever the library says
+  LEAVECriticalSection(section, kSource, __LINE__);
+  response->SetSuccess(Json::Value());
+}

@@ -1,0 +1,246 @@
+#include "log/log_reader.h"
+
+#include <sys/stat.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdio>
+#include <cstring>
+#include <string_view>
+
+#include "api/critical_section.h"
+#include "kova/conf.h"
+#include "kova/log.h"
+#include "kova/text.h"
+
+namespace {
+
+constexpr char kSource[] = "log";
+constexpr char kTempPrefix[] = "/tmp/kovalog";
+constexpr char kFetchLanguage[] = "enu";
+// One read of the log's copy takes at most this many bytes less one; a longer
+// line arrives in pieces, each parsed as a line of its own.
+constexpr size_t kLineBufferSize = 4096;
+constexpr size_t kPathSize = 4096;
+constexpr int kLeadingFields = 5;  // id, level, time, user, source; the event text follows
+
+// A text member of the filter: absent or null reads as empty.
+bool ReadText(const Json::Value& filter, const char* key, std::string& text) {
+  const Json::Value& member = filter[key];
+  if (member.isNull()) {
+    text.clear();
+    return true;
+  }
+  if (!member.isString()) return false;
+  text = member.asString();
+  return true;
+}
+
+// A time bound of the filter in seconds: absent or null reads as 0.
+bool ReadSeconds(const Json::Value& filter, const char* key, int64_t& seconds) {
+  const Json::Value& member = filter[key];
+  if (member.isNull()) {
+    seconds = 0;
+    return true;
+  }
+  if (!member.isInt64()) return false;
+  seconds = member.asInt64();
+  return true;
+}
+
+// The Unicode upper-case form of a NUL-terminated text of `length` bytes, made
+// in a buffer of length + 1 bytes: a text whose upper case is longer fails.
+class UpperCased {
+ public:
+  UpperCased(const char* text, size_t length) {
+    char* buffer = stack_;
+    if (length >= sizeof(stack_)) {
+      heap_.resize(length + 1);
+      buffer = heap_.data();
+    }
+    const int written = QLIBCUnicodeUTF8StrUpper(text, buffer, length + 1);
+    ok_ = written >= 0;
+    if (ok_) text_ = std::string_view(buffer, static_cast<size_t>(written));
+  }
+  UpperCased(const UpperCased&) = delete;
+  UpperCased& operator=(const UpperCased&) = delete;
+
+  bool ok() const { return ok_; }
+  bool Contains(const UpperCased& needle) const {
+    return ok_ && needle.ok_ && text_.find(needle.text_) != std::string_view::npos;
+  }
+
+ private:
+  char stack_[kLineBufferSize];
+  std::string heap_;
+  std::string_view text_;
+  bool ok_ = false;
+};
+
+// The fields of one line of the log's copy, split in place.
+struct LogLine {
+  const char* level;
+  const char* time;
+  const char* event;
+  size_t event_length;
+};
+
+// Splits `line` (NUL-terminated, `length` bytes) at tabs the way strtok_r does:
+// a run of tabs is one separator and leading tabs are skipped. The event text is
+// what follows the one tab that ends the fifth field. Each separator that ends a
+// field is overwritten with a NUL. False when there are fewer than five fields.
+bool SplitLine(char* line, size_t length, LogLine& out) {
+  const char* fields[kLeadingFields];
+  char* cursor = line;
+  for (const char*& field : fields) {
+    while (*cursor == '\t') ++cursor;
+    if (*cursor == '\0') return false;
+    field = cursor;
+    cursor = strchrnul(cursor, '\t');
+    if (*cursor == '\t') *cursor++ = '\0';
+  }
+  out = {fields[1], fields[2], cursor, static_cast<size_t>(line + length - cursor)};
+  return true;
+}
+
+// The filter's keyword, level and time tests, with its own texts prepared once.
+class LineTests {
+ public:
+  explicit LineTests(const LogFilter& filter)
+      : keyword_(filter.keyword.c_str(), filter.keyword.size()),
+        level_(filter.loglevel.c_str(), filter.loglevel.size()),
+        test_keyword_(!filter.keyword.empty()),
+        test_level_(!filter.loglevel.empty()),
+        from_(filter.datefrom != 0 ? KOVALogConvertTime1(filter.datefrom) : ""),
+        to_(filter.dateto != 0 ? KOVALogConvertTime1(filter.dateto) : "") {}
+
+  bool Pass(const LogLine& line) const {
+    // The keyword must occur in the event text.
+    if (test_keyword_ &&
+        (line.event_length == 0 || !UpperCased(line.event, line.event_length).Contains(keyword_))) {
+      return false;
+    }
+    // The line's level must occur in the requested level's name, so that
+    // "warn" or "WARNING" pass "Warning".
+    if (test_level_ && !level_.Contains(UpperCased(line.level, strlen(line.level)))) return false;
+    // Both bounds are inclusive, compared byte by byte.
+    const std::string_view time(line.time);
+    if (!from_.empty() && std::string_view(from_) > time) return false;
+    if (!to_.empty() && std::string_view(to_) < time) return false;
+    return true;
+  }
+
+ private:
+  const UpperCased keyword_;
+  const UpperCased level_;
+  const bool test_keyword_;
+  const bool test_level_;
+  const std::string from_;
+  const std::string to_;
+};
+
+Json::Value MakeEntry(const LogLine& line) {
+  Json::Value entry;
+  entry["event"] = Json::Value(line.event, line.event + line.event_length);
+  entry["time"] = Json::Value(line.time);
+  entry["level"] = Json::Value(line.level);
+  return entry;
+}
+
+// Parses the log's copy at `name` and appends the entries that pass `tests`. A
+// copy that can't be opened reads as empty.
+void ReadLogCopy(const char* name, const LineTests& tests, std::vector<Json::Value>& entries) {
+  FILE* file = fopen(name, "re");
+  if (file == nullptr) return;
+  setvbuf(file, nullptr, _IOFBF, 1 << 16);
+  char line[kLineBufferSize];
+  while (fgets(line, sizeof(line), file) != nullptr) {
+    size_t length = strlen(line);
+    if (length > 0 && line[length - 1] == '\n') line[--length] = '\0';
+    LogLine fields;
+    if (!SplitLine(line, length, fields)) {
+      // The line as splitting left it: cut at the tab that ends its first field.
+      syslog(LOG_ERR, "%s:%d Wrong log: %s", kSource, __LINE__, line);
+      continue;
+    }
+    if (tests.Pass(fields)) entries.push_back(MakeEntry(fields));
+  }
+  fclose(file);
+}
+
+std::string_view MemberText(const Json::Value& entry, const std::string& name) {
+  if (!entry.isObject()) return {};
+  const Json::Value* member = entry.find(name.data(), name.data() + name.size());
+  const char* begin = nullptr;
+  const char* end = nullptr;
+  if (member == nullptr || !member->getString(&begin, &end)) return {};
+  return std::string_view(begin, static_cast<size_t>(end - begin));
+}
+
+}  // namespace
+
+bool ParseLogFilter(const Json::Value& filter, int offset, int limit, LogFilter& out) {
+  if (!filter.isNull() && !filter.isObject()) return false;
+  std::string loglevel;
+  std::string keyword;
+  int64_t datefrom = 0;
+  int64_t dateto = 0;
+  if (!ReadText(filter, "loglevel", loglevel) || !ReadText(filter, "keyword", keyword) ||
+      !ReadSeconds(filter, "datefrom", datefrom) || !ReadSeconds(filter, "dateto", dateto)) {
+    return false;
+  }
+  if (!loglevel.empty() && loglevel != kLogLevelWarning && loglevel != kLogLevelCritical) {
+    return false;
+  }
+  out.offset = offset;
+  out.limit = limit;
+  out.sortOrder = "DESC";
+  out.sortField = "time";
+  out.dateto = dateto;
+  out.datefrom = datefrom;
+  out.loglevel = std::move(loglevel);
+  out.keyword = std::move(keyword);
+  return true;
+}
+
+bool ContainsIgnoreCase(const std::string& haystack, const std::string& needle) {
+  if (haystack.empty() || needle.empty()) return false;
+  return UpperCased(haystack.c_str(), haystack.size())
+      .Contains(UpperCased(needle.c_str(), needle.size()));
+}
+
+LogCompare::LogCompare(std::string sortField, bool ascending)
+    : sortField_(std::move(sortField)), ascending_(ascending) {}
+
+bool LogCompare::operator()(const Json::Value& a, const Json::Value& b) const {
+  const std::string_view first = MemberText(a, sortField_);
+  const std::string_view second = MemberText(b, sortField_);
+  return ascending_ ? first < second : first > second;
+}
+
+bool ProcessLog(const LogFilter& filter, std::vector<Json::Value>& entries) {
+  const LogCompare compare(filter.sortField, filter.sortOrder == "ASC");
+  char path[kPathSize];
+  memset(path, 0, sizeof(path));
+  if (KOVALogFilePathGet(kLogTypePerfEvent, path, sizeof(path)) < 0) return false;
+  // A log that was never written has no file: it is empty.
+  struct stat info;
+  if (stat(path, &info) != 0) return true;
+
+  const LineTests tests(filter);
+  char name[kPathSize];
+  memset(name, 0, sizeof(name));
+  QLIBCFileITmpName(kTempPrefix, name, sizeof(name));
+  CriticalSection section;
+  ENTERCriticalSection(section, kSource, __LINE__);
+  if (KOVALogGet1(kLogTypePerfEvent, name, kFetchLanguage) < 0) {
+    unlink(name);
+    return false;  // this early exit skips the leave on purpose: the ids stay raised
+  }
+  LEAVECriticalSection(section, kSource, __LINE__);
+  ReadLogCopy(name, tests, entries);
+  unlink(name);
+  if (!entries.empty()) std::sort(entries.begin(), entries.end(), compare);
+  return true;
+}

@@ -48,7 +48,7 @@ const std::string& LogFilePath() {
 }
 
 void SyncLogFile() {
-  if (TheState().log_lines) {
+  if (TheState().log_text) {
     std::ofstream(LogFilePath(), std::ios::app);
   } else {
     unlink(LogFilePath().c_str());
@@ -56,7 +56,9 @@ void SyncLogFile() {
 }
 
 void SetLogLines(const std::vector<std::string>& lines) {
-  TheState().log_lines = lines;
+  std::string& text = TheState().log_text.emplace();
+  for (const std::string& line : lines) text.append(line).push_back('\n');
+  TheState().log_records = static_cast<int>(lines.size());
   SyncLogFile();
 }
 
@@ -86,27 +88,27 @@ int KOVALogFilePathGet(int type, char* path, size_t size) {
 int KOVALogGet1(int type, const char* out_path, const char* language) {
   kova_fake::RecordLogCall("KOVALogGet1 " + std::to_string(type) + " " + language);
   if (type != kLogTypePerfEvent || TheState().log_fetch_fails) return -1;
-  std::ofstream out(out_path, std::ios::trunc);
-  for (const std::string& line : TheState().log_lines.value_or(std::vector<std::string>())) {
-    out << line << '\n';
-  }
-  return out ? 0 : -1;
+  FILE* out = fopen(out_path, "we");
+  if (out == nullptr) return -1;
+  const std::optional<std::string>& text = TheState().log_text;
+  const size_t size = text ? text->size() : 0;
+  const bool written = size == 0 || fwrite(text->data(), 1, size, out) == size;
+  return fclose(out) == 0 && written ? 0 : -1;
 }
 
 int KOVALogClean(int type) {
   kova_fake::RecordLogCall("KOVALogClean " + std::to_string(type));
   if (type != kLogTypePerfEvent) return -1;
-  if (TheState().log_lines) TheState().log_lines->clear();
+  if (TheState().log_text) TheState().log_text->clear();
   return 0;
 }
 
 int KOVALogWrite(int type, const char* level, const char* user, const char* source,
                  const char* event) {
   if (type != kLogTypePerfEvent) return -1;
-  auto& lines = TheState().log_lines;
-  if (!lines) lines.emplace();
-  lines->push_back(std::to_string(lines->size() + 1) + "\t" + level + "\t" +
-                   KOVALogConvertTime1(time(nullptr)) + "\t" + user + "\t" + source + "\t" + event);
+  std::string& text = TheState().log_text ? *TheState().log_text : TheState().log_text.emplace();
+  text += std::to_string(++TheState().log_records) + "\t" + level + "\t" +
+          KOVALogConvertTime1(time(nullptr)) + "\t" + user + "\t" + source + "\t" + event + "\n";
   kova_fake::SyncLogFile();
   return 0;
 }

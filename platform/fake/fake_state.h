@@ -26,7 +26,8 @@ struct State {
   std::map<std::string, std::pair<int, std::string>> volumes;
   std::deque<Exchange> exchanges;
   std::map<std::string, std::map<std::string, std::string>> texts;  // section -> key -> text
-  std::optional<std::vector<std::string>> log_lines;                // absent: no log file
+  std::optional<std::string> log_text;  // every line and its line feed; absent: no log file
+  int log_records = 0;
   bool log_fetch_fails = false;
   bool log_path_fails = false;
   std::vector<std::string> temp_files;

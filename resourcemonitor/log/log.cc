@@ -1,7 +1,5 @@
 #include "log/log.h"
 
-#include <vector>
-
 #include "api/critical_section.h"
 #include "api/error_report.h"
 #include "kova/log.h"
@@ -23,14 +21,14 @@ bool ParseListRequest(const KOVA::APIRequest& request, LogFilter& filter) {
                         filter);
 }
 
-// The page of `entries` that starts at `offset` and holds at most `limit`
-// entries (all when negative). The entries are moved into it.
-Json::Value TakePage(std::vector<Json::Value>& entries, int offset, int limit) {
+// The page of `records` that starts at `offset` and holds at most `limit`
+// entries (all when negative).
+Json::Value Page(const LogRecords& records, int offset, int limit) {
   Json::Value logs(Json::arrayValue);
   if (offset < 0 || limit == 0) return logs;
-  for (size_t i = static_cast<size_t>(offset); i < entries.size(); ++i) {
+  for (size_t i = static_cast<size_t>(offset); i < records.size(); ++i) {
     if (limit > 0 && logs.size() == static_cast<unsigned>(limit)) break;
-    logs.append(std::move(entries[i]));
+    logs.append(records.Entry(i));
   }
   return logs;
 }
@@ -42,11 +40,12 @@ void log_list_v1(KOVA::APIRequest* request, KOVA::APIResponse* response) {
   if (!ParseListRequest(*request, filter)) {
     return response->SetError(kErrorBadParameter, Json::Value());
   }
-  std::vector<Json::Value> entries;
-  const bool read = ProcessLog(filter, entries);
+  // Only the page is turned into JSON.
+  LogRecords records;
+  const bool read = ProcessLogRecords(filter, records);
   Json::Value reply;
-  reply["total"] = static_cast<Json::UInt>(entries.size());
-  reply["logs"] = TakePage(entries, filter.offset, filter.limit);
+  reply["total"] = static_cast<Json::UInt>(records.size());
+  reply["logs"] = Page(records, filter.offset, filter.limit);
   // An unreadable log is answered with the error record as it stands, beside
   // the empty page.
   if (!read) return SetErrorFromReport(response, reply);

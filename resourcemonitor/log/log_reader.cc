@@ -140,20 +140,15 @@ class LineTests {
   const std::string to_;
 };
 
-Json::Value MakeEntry(const LogLine& line) {
-  Json::Value entry;
-  entry["event"] = Json::Value(line.event, line.event + line.event_length);
-  entry["time"] = Json::Value(line.time);
-  entry["level"] = Json::Value(line.level);
-  return entry;
-}
-
 // Parses the log's copy at `name` and appends the entries that pass `tests`. A
 // copy that can't be opened reads as empty.
-void ReadLogCopy(const char* name, const LineTests& tests, std::vector<Json::Value>& entries) {
+void ReadLogCopy(const char* name, const LineTests& tests, LogRecords& records) {
   FILE* file = fopen(name, "re");
   if (file == nullptr) return;
   setvbuf(file, nullptr, _IOFBF, 1 << 16);
+  // Room for as many records as lines of a typical length fit in the file.
+  struct stat info;
+  if (fstat(fileno(file), &info) == 0) records.Reserve(static_cast<size_t>(info.st_size) / 96);
   char line[kLineBufferSize];
   while (fgets(line, sizeof(line), file) != nullptr) {
     size_t length = strlen(line);
@@ -164,18 +159,11 @@ void ReadLogCopy(const char* name, const LineTests& tests, std::vector<Json::Val
       syslog(LOG_ERR, "%s:%d Wrong log: %s", kSource, __LINE__, line);
       continue;
     }
-    if (tests.Pass(fields)) entries.push_back(MakeEntry(fields));
+    if (tests.Pass(fields)) {
+      records.Add(fields.level, fields.time, std::string_view(fields.event, fields.event_length));
+    }
   }
   fclose(file);
-}
-
-std::string_view MemberText(const Json::Value& entry, const std::string& name) {
-  if (!entry.isObject()) return {};
-  const Json::Value* member = entry.find(name.data(), name.data() + name.size());
-  const char* begin = nullptr;
-  const char* end = nullptr;
-  if (member == nullptr || !member->getString(&begin, &end)) return {};
-  return std::string_view(begin, static_cast<size_t>(end - begin));
 }
 
 }  // namespace
@@ -210,16 +198,7 @@ bool ContainsIgnoreCase(const std::string& haystack, const std::string& needle) 
       .Contains(UpperCased(needle.c_str(), needle.size()));
 }
 
-LogCompare::LogCompare(std::string sortField, bool ascending)
-    : sortField_(std::move(sortField)), ascending_(ascending) {}
-
-bool LogCompare::operator()(const Json::Value& a, const Json::Value& b) const {
-  const std::string_view first = MemberText(a, sortField_);
-  const std::string_view second = MemberText(b, sortField_);
-  return ascending_ ? first < second : first > second;
-}
-
-bool ProcessLog(const LogFilter& filter, std::vector<Json::Value>& entries) {
+bool ProcessLogRecords(const LogFilter& filter, LogRecords& records) {
   const LogCompare compare(filter.sortField, filter.sortOrder == "ASC");
   char path[kPathSize];
   memset(path, 0, sizeof(path));
@@ -239,8 +218,21 @@ bool ProcessLog(const LogFilter& filter, std::vector<Json::Value>& entries) {
     return false;  // this early exit skips the leave on purpose: the ids stay raised
   }
   LEAVECriticalSection(section, kSource, __LINE__);
-  ReadLogCopy(name, tests, entries);
+  ReadLogCopy(name, tests, records);
   unlink(name);
-  if (!entries.empty()) std::sort(entries.begin(), entries.end(), compare);
+  records.Sort(compare);
+  return true;
+}
+
+bool ProcessLog(const LogFilter& filter, std::vector<Json::Value>& entries) {
+  LogRecords records;
+  if (!ProcessLogRecords(filter, records)) return false;
+  const size_t before = entries.size();
+  entries.reserve(before + records.size());
+  for (size_t i = 0; i < records.size(); ++i) entries.push_back(records.Entry(i));
+  if (before > 0) {
+    std::sort(entries.begin(), entries.end(),
+              LogCompare(filter.sortField, filter.sortOrder == "ASC"));
+  }
   return true;
 }

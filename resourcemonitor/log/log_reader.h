@@ -14,6 +14,8 @@
 #include <string>
 #include <vector>
 
+#include "log/log_records.h"
+
 // What a request asks of the log. The handlers start from these values.
 struct LogFilter {
   int32_t offset = 0;    // first entry of a page (list only)
@@ -37,23 +39,15 @@ bool ParseLogFilter(const Json::Value& filter, int offset, int limit, LogFilter&
 // when either is empty or isn't valid UTF-8, or when upper-casing makes it longer.
 bool ContainsIgnoreCase(const std::string& haystack, const std::string& needle);
 
-// Orders entries by the text of one member, byte by byte, descending unless
-// ascending is asked for. A missing member compares as an empty text.
-class LogCompare {
- public:
-  LogCompare(std::string sortField, bool ascending);
-  bool operator()(const Json::Value& a, const Json::Value& b) const;
-
- private:
-  std::string sortField_;
-  bool ascending_;
-};
-
 // Appends every entry of the performance-event log that passes `filter` to
 // `entries` and sorts them. Returns true on success, also when the log has never
 // been written (no entries). Returns false when the log's path can't be had or
 // its fetch fails; a failed fetch leaves the process in the privileged section.
 // The temporary copy of the log is deleted on every path that made it.
 bool ProcessLog(const LogFilter& filter, std::vector<Json::Value>& entries);
+
+// ProcessLog without the JSON: reads the entries that pass `filter` into
+// `records` and sorts them. Same results and failures.
+bool ProcessLogRecords(const LogFilter& filter, LogRecords& records);
 
 #endif  // RESOURCEMONITOR_LOG_LOG_READER_H_

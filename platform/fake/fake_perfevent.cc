@@ -1,5 +1,7 @@
 // The test platform's rule store: rules in memory, lists allocated per call and
-// counted until freed.
+// tracked until freed.
+
+#include <unistd.h>
 
 #include <cstdio>
 #include <cstring>
@@ -12,9 +14,19 @@ namespace kova_fake {
 
 void FailRuleWrite(int error) { TheState().rule_write_error = error; }
 
+std::string AddRule(KOVAPERFEVENT_CONF_SETTING rule) {
+  snprintf(rule.id, sizeof(rule.id), "%d", TheState().next_rule_id++);
+  TheState().rules.push_back(rule);
+  return rule.id;
+}
+
 std::vector<KOVAPERFEVENT_CONF_SETTING> Rules() { return TheState().rules; }
 
-int OpenRuleLists() { return TheState().open_rule_lists; }
+void SetRuleListAnswer(RuleListAnswer answer) { TheState().rule_list_answer = answer; }
+
+int OpenRuleLists() { return static_cast<int>(TheState().open_rule_lists.size()); }
+
+int UnprivilegedRuleWrites() { return TheState().unprivileged_rule_writes; }
 
 namespace {
 
@@ -23,6 +35,12 @@ KOVAPERFEVENT_CONF_SETTING* FindRule(const char* id) {
     if (id != nullptr && strcmp(rule.id, id) == 0) return &rule;
   }
   return nullptr;
+}
+
+// Records a write to the store, counting it when made without root rights.
+void RecordWrite(const std::string& call) {
+  Record(call);
+  if (geteuid() != 0) ++TheState().unprivileged_rule_writes;
 }
 
 // Fails a write as arranged by FailRuleWrite.
@@ -35,32 +53,44 @@ bool WriteFails() {
 }  // namespace
 }  // namespace kova_fake
 
-using kova_fake::Record;
+using kova_fake::RuleListAnswer;
 using kova_fake::TheState;
 
 KovaPerfEventConfSettingNode* KOVAPerfEventConfListGet(const char* id) {
+  kova_fake::Record(id == nullptr ? "KOVAPerfEventConfListGet"
+                                  : "KOVAPerfEventConfListGet " + std::string(id));
   std::vector<KOVAPERFEVENT_CONF_SETTING> found;
   if (id == nullptr) {
     found = TheState().rules;
   } else if (const KOVAPERFEVENT_CONF_SETTING* rule = kova_fake::FindRule(id)) {
     found.push_back(*rule);
   } else {
+    KOVA_SET_ERROR(KOVA_ERR_NOT_FOUND);
     return nullptr;
   }
-  // An empty store answers a head without a record.
+  if (TheState().rule_list_answer == RuleListAnswer::kNull) {
+    KOVA_SET_ERROR(KOVA_ERR_STORE);
+    return nullptr;
+  }
+  if (TheState().rule_list_answer == RuleListAnswer::kEmptyHead) found.clear();
+  // An empty answer is a head without a record.
   auto* head = new KovaPerfEventConfSettingNode{nullptr, nullptr};
   KovaPerfEventConfSettingNode* tail = head;
   for (size_t i = 0; i < found.size(); ++i) {
     if (i > 0) tail = tail->next = new KovaPerfEventConfSettingNode{nullptr, nullptr};
     tail->setting = new KOVAPERFEVENT_CONF_SETTING(found[i]);
   }
-  ++TheState().open_rule_lists;
+  TheState().open_rule_lists.insert(head);
   return head;
 }
 
 void KOVAPerfEventConfListFree(KovaPerfEventConfSettingNode* head) {
   if (head == nullptr) return;
-  --TheState().open_rule_lists;
+  if (TheState().open_rule_lists.erase(head) == 0) {
+    kova_fake::Record("KOVAPerfEventConfListFree not open");
+    return;
+  }
+  kova_fake::Record("KOVAPerfEventConfListFree");
   while (head != nullptr) {
     KovaPerfEventConfSettingNode* next = head->next;
     delete head->setting;
@@ -72,7 +102,7 @@ void KOVAPerfEventConfListFree(KovaPerfEventConfSettingNode* head) {
 int KOVAPerfEventIsConfExisted(const char* id) { return kova_fake::FindRule(id) != nullptr; }
 
 int KOVAPerfEventConfAdd(KOVAPERFEVENT_CONF_SETTING* setting) {
-  Record("KOVAPerfEventConfAdd");
+  kova_fake::RecordWrite("KOVAPerfEventConfAdd");
   if (kova_fake::WriteFails()) return -1;
   snprintf(setting->id, sizeof(setting->id), "%d", TheState().next_rule_id++);
   TheState().rules.push_back(*setting);
@@ -80,7 +110,7 @@ int KOVAPerfEventConfAdd(KOVAPERFEVENT_CONF_SETTING* setting) {
 }
 
 int KOVAPerfEventConfSet(const KOVAPERFEVENT_CONF_SETTING* setting) {
-  Record(std::string("KOVAPerfEventConfSet ") + setting->id);
+  kova_fake::RecordWrite(std::string("KOVAPerfEventConfSet ") + setting->id);
   if (kova_fake::WriteFails()) return -1;
   KOVAPERFEVENT_CONF_SETTING* stored = kova_fake::FindRule(setting->id);
   if (stored == nullptr) {
@@ -92,7 +122,7 @@ int KOVAPerfEventConfSet(const KOVAPERFEVENT_CONF_SETTING* setting) {
 }
 
 int KOVAPerfEventConfDelete(const char* id) {
-  Record(std::string("KOVAPerfEventConfDelete ") + id);
+  kova_fake::RecordWrite(std::string("KOVAPerfEventConfDelete ") + id);
   auto& rules = TheState().rules;
   for (auto it = rules.begin(); it != rules.end(); ++it) {
     if (strcmp(it->id, id) == 0) {
@@ -100,5 +130,6 @@ int KOVAPerfEventConfDelete(const char* id) {
       return 0;
     }
   }
+  KOVA_SET_ERROR(KOVA_ERR_NOT_FOUND);
   return -1;
 }

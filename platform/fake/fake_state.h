@@ -5,6 +5,7 @@
 
 #include <deque>
 #include <map>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -34,7 +35,9 @@ struct State {
   std::vector<KOVAPERFEVENT_CONF_SETTING> rules;
   int next_rule_id = 1;
   int rule_write_error = 0;
-  int open_rule_lists = 0;
+  RuleListAnswer rule_list_answer = RuleListAnswer::kRules;
+  std::set<const KovaPerfEventConfSettingNode*> open_rule_lists;
+  int unprivileged_rule_writes = 0;
   std::vector<std::string> calls;
   std::vector<SyslogLine> syslog;
 };

@@ -67,9 +67,16 @@ const std::vector<std::string>& TempFiles();
 // The rule store. Ids are assigned "1", "2", ... on add. A failing add or set
 // returns -1 with `error` as the last platform error.
 void FailRuleWrite(int error);
+// Stores `rule` under the next id without recording a call, and returns the id.
+std::string AddRule(KOVAPERFEVENT_CONF_SETTING rule);
 std::vector<KOVAPERFEVENT_CONF_SETTING> Rules();
-// Lists handed out by KOVAPerfEventConfListGet and not yet freed.
+// What KOVAPerfEventConfListGet hands out for a stored id or for all rules.
+enum class RuleListAnswer { kRules, kNull, kEmptyHead };
+void SetRuleListAnswer(RuleListAnswer answer);
+// Lists not yet freed; gets and frees are calls, a stray free "KOVAPerfEventConfListFree not open".
 int OpenRuleLists();
+// Adds, sets and deletes made while the effective user id was not 0.
+int UnprivilegedRuleWrites();
 
 // Platform calls that read or change state, one line each, such as
 // "QLIBCINFOSetKeyValue resourcemonitor_history=yes" or "QLIBServiceStart kovaperfeventd".

@@ -116,11 +116,16 @@ TEST(ModuleTest, AnswersSettingsThroughTheTable) {
 // code, or only a code, reports the record as it was created.
 TEST(ModuleTest, FirstFailuresOfAFreshProcessReportTheInitialRecord) {
   const struct {
+    const char* api;
+    const char* method;
     const char* params;
     int code;
   } cases[] = {
-      {R"({"duration": 60})", 6199},    // the duration write fails and records nothing
-      {R"({"duration": "60"})", 6101},  // a wrong type records only its code
+      // The duration write fails and records nothing.
+      {kSetting, "set", R"({"duration": 60})", 6199},
+      // A wrong type, or a rule that can't be read, records only its code.
+      {kSetting, "set", R"({"duration": "60"})", 6101},
+      {"KOVA.ResourceMonitor.EventRule", "get", R"({"id": "1"})", 6102},
   };
   for (const auto& c : cases) {
     EXPECT_TRUE(RunInChild([&c] {
@@ -128,7 +133,7 @@ TEST(ModuleTest, FirstFailuresOfAFreshProcessReportTheInitialRecord) {
       kova_fake::FailConfWrite("resourcemonitor_realtime_max", -1);
       Module module = Load();
       ASSERT_NE(module.table, nullptr);
-      KOVA::APIResponse response = Call(module, kSetting, "set", c.params);
+      KOVA::APIResponse response = Call(module, c.api, c.method, c.params);
       EXPECT_EQ(response.GetErrorCode(), c.code);
       EXPECT_EQ(response.GetData(), ParseJson(R"({"err_line": 0, "err_msg": "",
                                                   "err_session": "", "err_key": ""})"));

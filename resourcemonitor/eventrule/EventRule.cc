@@ -109,7 +109,11 @@ std::string ServiceDisplayName(const std::string& language, const std::string& s
   name[sizeof(name) - 1] = '\0';
   const char* package = strlen(name) > kPackagePrefixLength ? name + kPackagePrefixLength : "";
   char path[1024] = {};
-  snprintf(path, sizeof(path), "/var/packages/%s/INFO", package);
+  // A package name too long for the path can't name an INFO file.
+  if (snprintf(path, sizeof(path), "/var/packages/%s/INFO", package) >=
+      static_cast<int>(sizeof(path))) {
+    return display;
+  }
   // The key buffer holds at most 19 characters of the language code.
   char key[32] = {};
   snprintf(key, sizeof(key), "displayname_%s", language.c_str());

@@ -49,6 +49,26 @@ bool ReadSeconds(const Json::Value& filter, const char* key, int64_t& seconds) {
   return true;
 }
 
+// Whether the NUL-terminated `text` of at most `length` bytes is ASCII. ASCII
+// text upper-cases the same under every Unicode case mapping, in place and
+// without growing, so the common case needs no trip to the platform.
+bool IsAscii(const char* text, size_t length) {
+  for (size_t i = 0; i < length && text[i] != '\0'; ++i) {
+    if (static_cast<unsigned char>(text[i]) >= 0x80) return false;
+  }
+  return true;
+}
+
+int AsciiUpper(const char* text, char* buffer) {
+  int length = 0;
+  for (; text[length] != '\0'; ++length) {
+    const char c = text[length];
+    buffer[length] = c >= 'a' && c <= 'z' ? static_cast<char>(c - 'a' + 'A') : c;
+  }
+  buffer[length] = '\0';
+  return length;
+}
+
 // The Unicode upper-case form of a NUL-terminated text of `length` bytes, made
 // in a buffer of length + 1 bytes: a text whose upper case is longer fails.
 class UpperCased {
@@ -59,7 +79,8 @@ class UpperCased {
       heap_.resize(length + 1);
       buffer = heap_.data();
     }
-    const int written = QLIBCUnicodeUTF8StrUpper(text, buffer, length + 1);
+    const int written = IsAscii(text, length) ? AsciiUpper(text, buffer)
+                                              : QLIBCUnicodeUTF8StrUpper(text, buffer, length + 1);
     ok_ = written >= 0;
     if (ok_) text_ = std::string_view(buffer, static_cast<size_t>(written));
   }

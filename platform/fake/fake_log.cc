@@ -66,6 +66,8 @@ void FailLogFetch(bool fail) { TheState().log_fetch_fails = fail; }
 
 void FailLogPath(bool fail) { TheState().log_path_fails = fail; }
 
+void FailLogClean(bool fail) { TheState().log_clean_fails = fail; }
+
 namespace {
 
 // Records a call on the log with the effective user id it ran under.
@@ -98,7 +100,7 @@ int KOVALogGet1(int type, const char* out_path, const char* language) {
 
 int KOVALogClean(int type) {
   kova_fake::RecordLogCall("KOVALogClean " + std::to_string(type));
-  if (type != kLogTypePerfEvent) return -1;
+  if (type != kLogTypePerfEvent || TheState().log_clean_fails) return -1;
   if (TheState().log_text) TheState().log_text->clear();
   return 0;
 }

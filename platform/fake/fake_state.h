@@ -31,6 +31,7 @@ struct State {
   int log_records = 0;
   bool log_fetch_fails = false;
   bool log_path_fails = false;
+  bool log_clean_fails = false;
   std::vector<std::string> temp_files;
   std::vector<KOVAPERFEVENT_CONF_SETTING> rules;
   int next_rule_id = 1;

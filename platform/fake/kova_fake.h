@@ -55,12 +55,13 @@ void QueueExchange(const Exchange& exchange);
 void SetText(const std::string& section, const std::string& key, const std::string& text);
 
 // The performance-event log: whether its file exists, the lines a fetch writes
-// (each followed by a line feed), a fetch that fails and a path lookup that
+// (each followed by a line feed), and a fetch, a path lookup or a clean that
 // fails. KOVALogWrite appends a line. Fetch and clean are recorded with the
 // effective user id they ran under, as in "KOVALogClean 18 euid=0".
 void SetLogLines(const std::vector<std::string>& lines);
 void FailLogFetch(bool fail);
 void FailLogPath(bool fail);
+void FailLogClean(bool fail);
 // Paths handed out by QLIBCFileITmpName.
 const std::vector<std::string>& TempFiles();
 

@@ -126,17 +126,25 @@ TEST(ModuleTest, FirstFailuresOfAFreshProcessReportTheInitialRecord) {
       // A wrong type, or a rule that can't be read, records only its code.
       {kSetting, "set", R"({"duration": "60"})", 6101},
       {"KOVA.ResourceMonitor.EventRule", "get", R"({"id": "1"})", 6102},
+      // An unreadable log answers the record as it is, beside an empty page.
+      {"KOVA.ResourceMonitor.Log", "list", "{}", 6199},
   };
   for (const auto& c : cases) {
     EXPECT_TRUE(RunInChild([&c] {
       kova_fake::Reset();
       kova_fake::FailConfWrite("resourcemonitor_realtime_max", -1);
+      kova_fake::FailLogPath(true);
       Module module = Load();
       ASSERT_NE(module.table, nullptr);
       KOVA::APIResponse response = Call(module, c.api, c.method, c.params);
       EXPECT_EQ(response.GetErrorCode(), c.code);
-      EXPECT_EQ(response.GetData(), ParseJson(R"({"err_line": 0, "err_msg": "",
-                                                  "err_session": "", "err_key": ""})"));
+      Json::Value expected = ParseJson(R"({"err_line": 0, "err_msg": "",
+                                           "err_session": "", "err_key": ""})");
+      if (std::string(c.method) == "list") {
+        expected["total"] = Json::UInt(0);
+        expected["logs"] = Json::Value(Json::arrayValue);
+      }
+      EXPECT_EQ(response.GetData(), expected);
     })) << c.params;
   }
 }

@@ -1,5 +1,7 @@
 #include "log/log.h"
 
+#include <climits>
+
 #include "api/critical_section.h"
 #include "api/error_report.h"
 #include "kova/log.h"
@@ -9,16 +11,30 @@ namespace {
 
 constexpr char kSource[] = "log";
 
+// A page bound as the JSON library reads a number, cut to the int range: an
+// offset past any log gives an empty page, a limit past any log gives all of
+// it. False for a text, an array or an object.
+bool ReadPageBound(const Json::Value& value, int& bound) {
+  if (value.isNull() || value.isBool() || value.isInt()) {
+    bound = value.asInt();
+    return true;
+  }
+  if (!value.isDouble()) return false;
+  const double number = value.asDouble();
+  bound = number >= INT_MAX ? INT_MAX : number <= INT_MIN ? INT_MIN : static_cast<int>(number);
+  return true;
+}
+
 // Reads "offset", "limit" and "filter" into `filter`. False when one of them
 // can't be read as what it stands for, or the filter's level is not acceptable.
 bool ParseListRequest(const KOVA::APIRequest& request, LogFilter& filter) {
-  const Json::Value offset = request.GetParam("offset", Json::Value(0));
-  const Json::Value limit = request.GetParam("limit", Json::Value(-1));
-  if (!offset.isConvertibleTo(Json::intValue) || !limit.isConvertibleTo(Json::intValue)) {
+  int offset = 0;
+  int limit = -1;
+  if (!ReadPageBound(request.GetParam("offset", Json::Value(0)), offset) ||
+      !ReadPageBound(request.GetParam("limit", Json::Value(-1)), limit)) {
     return false;
   }
-  return ParseLogFilter(request.GetParam("filter", Json::Value()), offset.asInt(), limit.asInt(),
-                        filter);
+  return ParseLogFilter(request.GetParam("filter", Json::Value()), offset, limit, filter);
 }
 
 // The page of `records` that starts at `offset` and holds at most `limit`

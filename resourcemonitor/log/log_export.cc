@@ -85,9 +85,10 @@ std::string DownloadName(const char* type) {
 
 // Writes the HTTP header lines and the body to standard output, then flushes it.
 void WriteDownload(const ExportFormat& format, const std::vector<Json::Value>& entries) {
+  const std::string name = DownloadName(format.type);
   printf("Content-Type: %s\r\n", format.content_type);
   printf("Content-Disposition:attachment; filename=\"%s\"\r\n\r\n",
-         WebUtils::EncodeURL(DownloadName(format.type)).c_str());
+         WebUtils::EncodeURL(name).c_str());
   Print(format.page_start);
   if (!entries.empty()) {
     Print(format.table_start);

@@ -5,8 +5,10 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <cmath>
 #include <cstdio>
 #include <cstring>
+#include <new>
 #include <string_view>
 
 #include "api/critical_section.h"
@@ -25,33 +27,30 @@ constexpr size_t kLineBufferSize = 4096;
 constexpr size_t kPathSize = 4096;
 constexpr int kLeadingFields = 5;  // id, level, time, user, source; the event text follows
 
-// A text member of the filter: absent or null reads as empty.
+// A text member of the filter, as the JSON library reads any scalar: absent or
+// null reads as empty, a number as its digits. False for an array or object.
 bool ReadText(const Json::Value& filter, const char* key, std::string& text) {
   const Json::Value& member = filter[key];
-  if (member.isNull()) {
-    text.clear();
-    return true;
-  }
-  if (!member.isString()) return false;
+  if (!member.isConvertibleTo(Json::stringValue)) return false;
   text = member.asString();
   return true;
 }
 
-// A time bound of the filter in seconds: absent or null reads as 0.
+// A time bound of the filter in seconds, as the JSON library reads a number:
+// absent or null reads as 0, a fraction is cut off. False for a text, an array,
+// an object or a number out of range.
 bool ReadSeconds(const Json::Value& filter, const char* key, int64_t& seconds) {
   const Json::Value& member = filter[key];
-  if (member.isNull()) {
-    seconds = 0;
-    return true;
-  }
-  if (!member.isInt64()) return false;
+  const bool readable = member.isNull() || member.isBool() || member.isInt64() ||
+                        (member.isDouble() && std::fabs(member.asDouble()) < 9.2e18);
+  if (!readable) return false;
   seconds = member.asInt64();
   return true;
 }
 
-// Whether the NUL-terminated `text` of at most `length` bytes is ASCII. ASCII
-// text upper-cases the same under every Unicode case mapping, in place and
-// without growing, so the common case needs no trip to the platform.
+// Whether the NUL-terminated `text` of at most `length` bytes is ASCII. The
+// platform's Unicode mapping upper-cases ASCII letter for letter, without
+// growing, so the common case needs no trip to the platform.
 bool IsAscii(const char* text, size_t length) {
   for (size_t i = 0; i < length && text[i] != '\0'; ++i) {
     if (static_cast<unsigned char>(text[i]) >= 0x80) return false;
@@ -161,6 +160,18 @@ class LineTests {
   const std::string to_;
 };
 
+// Deletes the log's copy when the read ends, however it ends.
+class RemoveOnExit {
+ public:
+  explicit RemoveOnExit(const char* path) : path_(path) {}
+  ~RemoveOnExit() { unlink(path_); }
+  RemoveOnExit(const RemoveOnExit&) = delete;
+  RemoveOnExit& operator=(const RemoveOnExit&) = delete;
+
+ private:
+  const char* path_;
+};
+
 // Parses the log's copy at `name` and appends the entries that pass `tests`. A
 // copy that can't be opened reads as empty.
 void ReadLogCopy(const char* name, const LineTests& tests, LogRecords& records) {
@@ -232,16 +243,19 @@ bool ProcessLogRecords(const LogFilter& filter, LogRecords& records) {
   char name[kPathSize];
   memset(name, 0, sizeof(name));
   QLIBCFileITmpName(kTempPrefix, name, sizeof(name));
+  const RemoveOnExit remove_copy(name);
   CriticalSection section;
   ENTERCriticalSection(section, kSource, __LINE__);
   if (KOVALogGet1(kLogTypePerfEvent, name, kFetchLanguage) < 0) {
-    unlink(name);
     return false;  // this early exit skips the leave on purpose: the ids stay raised
   }
   LEAVECriticalSection(section, kSource, __LINE__);
-  ReadLogCopy(name, tests, records);
-  unlink(name);
-  records.Sort(compare);
+  try {
+    ReadLogCopy(name, tests, records);
+    records.Sort(compare);
+  } catch (const std::bad_alloc&) {
+    return false;  // a log too large for memory can't be read
+  }
   return true;
 }
 
@@ -249,8 +263,13 @@ bool ProcessLog(const LogFilter& filter, std::vector<Json::Value>& entries) {
   LogRecords records;
   if (!ProcessLogRecords(filter, records)) return false;
   const size_t before = entries.size();
-  entries.reserve(before + records.size());
-  for (size_t i = 0; i < records.size(); ++i) entries.push_back(records.Entry(i));
+  try {
+    entries.reserve(before + records.size());
+    for (size_t i = 0; i < records.size(); ++i) entries.push_back(records.Entry(i));
+  } catch (const std::bad_alloc&) {
+    entries.resize(before);
+    return false;
+  }
   if (before > 0) {
     std::sort(entries.begin(), entries.end(),
               LogCompare(filter.sortField, filter.sortOrder == "ASC"));

@@ -1,8 +1,8 @@
 // The module KOVA.ResourceMonitor.so loaded with dlopen over the real platform
 // (libkova.so, linked into this program) in a temporary system root: its
-// methods write the configuration, start and stop the daemon, and read the log
-// for real. Each test runs the module in a child process with the host's ids:
-// unprivileged effective ids, saved ids 0.
+// methods write the configuration, start and stop the daemon, read the log and
+// keep the rules for real. Each test runs the module in a child process with
+// the host's ids: unprivileged effective ids, saved ids 0.
 
 #include <dlfcn.h>
 #include <gmock/gmock.h>
@@ -36,6 +36,7 @@ using ::testing::HasSubstr;
 
 constexpr char kSetting[] = "KOVA.ResourceMonitor.Setting";
 constexpr char kLog[] = "KOVA.ResourceMonitor.Log";
+constexpr char kRule[] = "KOVA.ResourceMonitor.EventRule";
 
 // The performance-event daemon as a script: it notes its user and reloads.
 constexpr char kDaemon[] = R"sh(trap 'echo reload >> "$KOVA_ROOT/daemon.log"' HUP
@@ -117,10 +118,11 @@ class ModuleTest : public ::testing::Test {
     });
   }
 
-  KOVA::APIResponse Call(const char* api, const char* method, const std::string& params = "{}") {
+  KOVA::APIResponse Call(const char* api, const char* method, const std::string& params = "{}",
+                         const std::string& language = "enu") {
     for (const APITableEntry* row = table_; row != nullptr && row->api != nullptr; ++row) {
       if (std::string(row->api) == api && std::string(row->method) == method) {
-        return kova_fake::CallHandler(row->handler, params);
+        return kova_fake::CallHandler(row->handler, params, language);
       }
     }
     ADD_FAILURE() << api << " " << method << " not in the table";
@@ -175,6 +177,15 @@ TEST_F(ModuleTest, SettingsAreWrittenAndTheDaemonRuns) {
   struct stat info;
   ASSERT_EQ(stat(root_.Path(kKovaInfoConf).c_str(), &info), 0);
   EXPECT_EQ(info.st_uid, 0u);
+}
+
+// Waits up to three seconds for `done` to hold.
+template <typename Done>
+bool Eventually(Done done) {
+  for (int i = 0; i < 150 && !done(); ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  }
+  return done();
 }
 
 // Runs the kova command with `args` on the test's root.
@@ -241,6 +252,71 @@ TEST_F(ModuleTest, LogIsListedFilteredExportedAndCleared) {
     if (entry.path().filename() != "download") left.push_back(entry.path().filename());
   }
   EXPECT_THAT(left, ::testing::IsEmpty());
+}
+
+// The display name of each rule's object, the names of rules listed in order.
+std::vector<std::string> Names(const KOVA::APIResponse& list) {
+  std::vector<std::string> names;
+  for (const Json::Value& rule : list.GetData()["rules"]) {
+    names.push_back(rule["id"].asString() + " " + rule["name"].asString());
+  }
+  return names;
+}
+
+TEST_F(ModuleTest, RulesAreStoredNamedSwitchedAndDeleted) {
+  root_.Write("/etc/kova/services/smb.conf",
+              "command=\"/bin/sleep 300\"\ndisplay_name=\"Windows file service\"\n");
+  root_.Write("/var/packages/photos/INFO", "displayname=\"Photos\"\ndisplayname_ger=\"Fotos\"\n");
+  ASSERT_EQ(Kova({"lun", "add", "lun-1", "Backup LUN"}), 0);
+  ASSERT_EQ(Kova({"conf", "set", "support_performance_event_internal", "yes"}), 0);
+  ASSERT_EQ(QLIBServiceStart("kovaperfeventd", 0), 0);
+  ASSERT_TRUE(Eventually([&] { return root_.Read("/daemon.log") == "uid 0\n"; }));
+  EXPECT_TRUE(AsHost([&] {
+    for (const char* rule : {
+             R"({"service": "smb", "type": 1, "resource": 1, "severity": 1, "threshold": 80,
+                 "enable": true})",
+             R"({"service": "lun-1", "type": 2, "resource": 3, "severity": 2, "threshold": 5000,
+                 "enable": false})",
+             R"({"service": "pkgctl-photos", "type": 1, "resource": 2, "severity": 1,
+                 "threshold": 90, "enable": true})",
+         }) {
+      EXPECT_EQ(Call(kRule, "set", rule).GetState(), KOVA::APIResponse::State::kSuccess) << rule;
+    }
+    EXPECT_EQ(Call(kRule, "set", R"({"service": "smb", "type": 1, "resource": 1, "severity": 1,
+                                     "threshold": 50, "enable": true})")
+                  .GetErrorCode(),
+              6106);
+    EXPECT_EQ(Call(kRule, "set", R"({"id": "99", "service": "smb", "type": 1, "resource": 1,
+                                     "severity": 2})")
+                  .GetErrorCode(),
+              6107);
+
+    KOVA::APIResponse list = Call(kRule, "list");
+    EXPECT_EQ(list.GetData()["total"].asInt(), 3);
+    EXPECT_EQ(list.GetData()["support_internal"].asInt(), 1);
+    EXPECT_EQ(Names(list),
+              (std::vector<std::string>{"1 Windows file service", "2 Backup LUN", "3 Photos"}));
+    EXPECT_EQ(Names(Call(kRule, "list", R"({"offset": 2})", "ger")),
+              std::vector<std::string>{"3 Fotos"});
+
+    EXPECT_EQ(Call(kRule, "get", R"({"id": "2"})").GetData(),
+              ParseJson(R"({"id": "2", "enable": false, "service": "lun-1", "name": "Backup LUN",
+                            "type": 2, "severity": 2, "resource": 3, "threshold": 5000})"));
+    EXPECT_EQ(Call(kRule, "onoff", R"({"id_list": [{"id": "2", "enable": true}]})").GetState(),
+              KOVA::APIResponse::State::kSuccess);
+    EXPECT_TRUE(Call(kRule, "get", R"({"id": "2"})").GetData()["enable"].asBool());
+
+    EXPECT_EQ(Call(kRule, "delete", R"({"id_list": ["1", "3", "77"]})").GetState(),
+              KOVA::APIResponse::State::kSuccess);
+    EXPECT_EQ(Names(Call(kRule, "list")), std::vector<std::string>{"2 Backup LUN"});
+    EXPECT_EQ(Call(kRule, "get", R"({"id": "1"})").GetErrorCode(), 6102);
+  }));
+  // Every change asked the running daemon to reload (signals in a burst may merge).
+  EXPECT_TRUE(
+      Eventually([&] { return root_.Read("/daemon.log").find("reload") != std::string::npos; }));
+  struct stat info;
+  ASSERT_EQ(stat(root_.Path("/var/lib/kova/perfevent/rules.db").c_str(), &info), 0);
+  EXPECT_EQ(info.st_uid, 0u);
 }
 
 }  // namespace

@@ -54,6 +54,8 @@ bool ReadWholeFile(const std::string& path, std::string& content) {
 
 namespace {
 
+constexpr char kTempInfix[] = ".tmp.";
+
 bool WriteAll(int fd, const std::string& content) {
   size_t done = 0;
   while (done < content.size()) {
@@ -84,12 +86,12 @@ void RemoveStaleTemporaries(const std::string& path) {
   const std::string dir = slash == std::string::npos ? "."
                           : slash == 0               ? "/"
                                                      : path.substr(0, slash);
-  const std::string prefix = path.substr(slash + 1) + ".";
+  const std::string prefix = path.substr(slash + 1) + kTempInfix;
   DIR* stream = opendir(dir.c_str());
   if (stream == nullptr) return;
   while (const dirent* entry = readdir(stream)) {
     const std::string name = entry->d_name;
-    // mkostemp's names: the prefix and six characters (the lock file has four).
+    // The names ReplaceFile gives its temporary files: the infix and six characters.
     if (name.size() == prefix.size() + 6 && name.compare(0, prefix.size(), prefix) == 0) {
       unlinkat(dirfd(stream), name.c_str(), 0);
     }
@@ -98,7 +100,7 @@ void RemoveStaleTemporaries(const std::string& path) {
 }
 
 bool ReplaceFile(const std::string& path, const std::string& content, mode_t mode) {
-  std::string temp = path + ".XXXXXX";
+  std::string temp = path + kTempInfix + "XXXXXX";
   const int fd = mkostemp(temp.data(), O_CLOEXEC);
   if (fd < 0) return false;
   struct stat old;

@@ -39,7 +39,8 @@ void Tell(int fd, char tag, int value) {
   if (null > 2) close(null);
   // Nothing of this process but the standard streams reaches the service.
   close_range(3, ~0U, CLOSE_RANGE_CLOEXEC);
-  signal(SIGPIPE, SIG_DFL);
+  // Ignored signals would stay ignored in the service: SIGTERM and SIGHUP must work.
+  for (int number = 1; number < NSIG; ++number) signal(number, SIG_DFL);
   sigset_t none;
   sigemptyset(&none);
   sigprocmask(SIG_SETMASK, &none, nullptr);

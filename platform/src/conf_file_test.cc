@@ -64,14 +64,10 @@ TEST(ConfFileTest, MissingFileHasNoKeysAndUnreadableFileFails) {
   EXPECT_LT(QLIBCFileGetKeyValue("/etc/directory.conf", "key", value, sizeof(value), 0), 0);
   EXPECT_EQ(QLIBCErrGet(), KOVA_ERR_IO);
   EXPECT_LT(QLIBCFileCheckKeyValue("/etc/directory.conf", "key", "v", 0), 0);
-}
-
-TEST(ConfFileTest, CutsLongValuesToTheBuffer) {
-  TestRoot root;
-  root.Write("/etc/test.conf", "long=\"abcdefghij\"\n");
-  char value[5];
-  EXPECT_GT(QLIBCFileGetKeyValue("/etc/test.conf", "long", value, sizeof(value), 0), 0);
-  EXPECT_STREQ(value, "abcd");
+  root.Write("/etc/long.conf", "long=\"abcdefghij\"\n");
+  char cut[5];
+  EXPECT_GT(QLIBCFileGetKeyValue("/etc/long.conf", "long", cut, sizeof(cut), 0), 0);
+  EXPECT_STREQ(cut, "abcd");
 }
 
 TEST(ConfFileTest, WritesKeepOtherLinesAndTheirOrder) {
@@ -169,21 +165,12 @@ TEST(ConfFileTest, KilledWriterNeverLeavesAPartialFile) {
   EXPECT_EQ(files, 2);  // the lock file and the operator's backup
 }
 
-// The host's identity: unprivileged effective ids, saved ids 0.
-TEST(ConfFileTest, WritesAsRootFromTheHostsIdsAndRestoresThem) {
+// Root writes for the host's ids (the end-to-end test); a process that may not
+// become root fails and says why.
+TEST(ConfFileTest, UnprivilegedWriterFailsWithPermissionDenied) {
   TestRoot root;
-  EXPECT_TRUE(kova_fake::RunInChild([&root] {
-    ASSERT_EQ(setresgid(1000, 1000, 0), 0);
-    ASSERT_EQ(setresuid(1000, 1000, 0), 0);
-    ASSERT_EQ(QLIBCINFOSetKeyValue("resourcemonitor_history", "yes"), 0);
-    EXPECT_EQ(geteuid(), 1000u);
-    EXPECT_EQ(getegid(), 1000u);
-    struct stat info;
-    ASSERT_EQ(stat(root.Path(kKovaInfoConf).c_str(), &info), 0);
-    EXPECT_EQ(info.st_uid, 0u);
-    EXPECT_EQ(info.st_mode & 07777, 0644u);
-  }));
-  EXPECT_TRUE(kova_fake::RunInChild([&root] {
+  ASSERT_EQ(QLIBCINFOSetKeyValue("resourcemonitor_history", "yes"), 0);
+  EXPECT_TRUE(kova_fake::RunInChild([] {
     ASSERT_EQ(setresgid(1000, 1000, 1000), 0);
     ASSERT_EQ(setresuid(1000, 1000, 1000), 0);
     EXPECT_EQ(QLIBCINFOSetKeyValue("resourcemonitor_history", "no"), -1);

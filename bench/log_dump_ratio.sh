@@ -1,15 +1,13 @@
 #!/usr/bin/env bash
 # Runs the log dump benchmark and prints the time of KOVALogGet1 as a ratio of
 # the sqlite3 shell's time for the same table, measured in the same run.
-# Usage: bench/log_dump_ratio.sh [BUILD_DIR]   (a Release build; build/release
-# by default, configured and built when missing)
+# Usage: bench/log_dump_ratio.sh [BUILD_DIR]   (a Release build, build/release
+# by default; the benchmark is built there first)
 set -euo pipefail
 cd "$(dirname "$0")/.."
 build=${1:-build/release}
-if [ ! -x "$build/bench/log_dump_bench" ]; then
-  cmake -S . -B "$build" -DCMAKE_BUILD_TYPE=Release >/dev/null
-  cmake --build "$build" -j 2 --target log_dump_bench >/dev/null
-fi
+[ -f "$build/CMakeCache.txt" ] || cmake -S . -B "$build" -DCMAKE_BUILD_TYPE=Release >/dev/null
+cmake --build "$build" -j 2 --target log_dump_bench >/dev/null
 "$build/bench/log_dump_bench" --benchmark_format=csv 2>/dev/null | awk -F, '
   /^"BM_/ && $9 == "true" { print "benchmark failed: " $1 " " $10; failed = 1 }
   /^"BM_KOVALogGet1/ { kova = $3 }

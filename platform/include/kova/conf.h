@@ -18,6 +18,7 @@ inline constexpr char kKovaInfoConf[] = "/etc/kovainfo.conf";
 // and cut to fit. `flags` is reserved; pass 0. Returns a positive number when the
 // key was found, 0 when the file has no such key (`value` left untouched), and a
 // negative number when the file could not be read (the last platform error says why).
+// A file that doesn't exist has no keys.
 KOVA_API int QLIBCFileGetKeyValue(const char* file, const char* key, char* value, size_t size,
                                   int flags);
 

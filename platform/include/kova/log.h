@@ -30,7 +30,8 @@ KOVA_API int KOVALogFilePathGet(int type, char* path, size_t size);
 
 // Writes every record of log `type`, oldest first, as text lines into the file
 // `out_path` (created or truncated), with the texts in `language`. Returns 0 on
-// success, -1 on failure.
+// success, -1 on failure. A log never written gives an empty file; `out_path`
+// is a real path and is never followed when it is a symbolic link.
 KOVA_API int KOVALogGet1(int type, const char* out_path, const char* language);
 
 // The time `seconds` since the epoch as the "time" field of fetched lines holds
@@ -43,7 +44,10 @@ KOVA_API int KOVALogClean(int type);
 
 // Adds a record to log `type`, stamped with the current time. `level` is one of
 // the levels above; `user` and `source` name who and what raised it; none of the
-// three may be empty. Returns 0 on success, -1 on failure.
+// three may be empty. Tabs and line breaks that would split a fetched line become
+// blanks. A log keeps its newest records only (100,000 unless the key
+// "log_max_records" of kKovaInfoConf says otherwise). Returns 0 on success, -1 on
+// failure.
 KOVA_API int KOVALogWrite(int type, const char* level, const char* user, const char* source,
                           const char* event);
 

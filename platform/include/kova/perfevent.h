@@ -21,7 +21,9 @@ enum KOVAPERFEVENT_EVENT_TYPE : int32_t {
   PERFEVENT_TYPE_ISCSI_LUN = 2,  // an iSCSI LUN; `service` is its uuid
 };
 
-// Resources a rule can watch, with the unit of its threshold.
+// Resources a rule can watch, with the unit of its threshold. A service's rule
+// watches the CPU or memory of the service's processes; a LUN's rule its I/O
+// rate or latency; a system rule any of the four for the whole system.
 enum KOVAPERFEVENT_RESOURCE : int32_t {
   PERFEVENT_RESOURCE_CPU = 1,         // CPU use, percent of all CPUs
   PERFEVENT_RESOURCE_MEMORY = 2,      // memory in use, percent of all memory
@@ -81,9 +83,12 @@ KOVA_API void KOVAPerfEventConfListFree(KovaPerfEventConfSettingNode* head);
 KOVA_API int KOVAPerfEventIsConfExisted(const char* id);
 
 // Stores `setting` as a new rule, assigning it a new id that is written into its
-// `id`. Returns 0 on success; negative on failure, with the last platform error
-// KOVA_ERR_PERFEVENT_DUPLICATE when another rule has the same object, resource
-// and severity.
+// `id`; ids are never given twice. Returns 0 on success; negative on failure, with
+// the last platform error KOVA_ERR_PERFEVENT_DUPLICATE when another rule has the
+// same object, resource and severity, and KOVA_ERR_INVALID for a rule the daemon
+// can't watch: a resource that doesn't fit the type, an unknown severity, an
+// empty object of a service or LUN, a negative threshold or a percentage above
+// 100, `preset_a` below 1, `preset_b` below 0, or `enable` other than 0 and 1.
 KOVA_API int KOVAPerfEventConfAdd(KOVAPERFEVENT_CONF_SETTING* setting);
 
 // Overwrites the stored rule whose id `setting` carries. Returns 0 on success;

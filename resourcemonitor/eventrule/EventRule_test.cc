@@ -5,14 +5,16 @@
 #include <syslog.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cstdio>
 #include <functional>
 #include <map>
+#include <regex>
+#include <tuple>
 
 #include "fake/host_call.h"
 #include "fake/kova_fake.h"
 #include "fake/run_in_child.h"
+#include "kova/conf.h"
 #include "kova/error.h"
 #include "setting/resource_api.h"
 
@@ -21,23 +23,30 @@ namespace {
 using kova_fake::CallHandler;
 using kova_fake::ParseJson;
 using kova_fake::RuleListAnswer;
-using ::testing::Contains;
-using ::testing::Each;
-using ::testing::ElementsAre;
-using ::testing::ElementsAreArray;
-using ::testing::IsEmpty;
-using ::testing::MatchesRegex;
-using ::testing::Not;
+using Strings = std::vector<std::string>;
 
-constexpr char kReload[] = "QLIBServiceReload kovaperfeventd";
+constexpr char kGet1[] = "KOVAPerfEventConfListGet 1";
+constexpr char kSet1[] = "KOVAPerfEventConfSet 1";
+constexpr char kAdd[] = "KOVAPerfEventConfAdd";
 constexpr char kFree[] = "KOVAPerfEventConfListFree";
+constexpr char kReload[] = "QLIBServiceReload kovaperfeventd";
+constexpr char kReloadFailed[] =
+    "EventRule:N Failed to reload kovaperfeventd [0x1001 fake_system.cc:N]";
 constexpr char kInfo[] = "/var/packages/Foo/INFO";
 constexpr char kSupportKey[] = "support_performance_event_internal";
+
+// Arrangements of the rule store shared by the tables.
+const std::function<void()> kAsIs = [] {};
+const std::function<void()> kDuplicate = [] { kova_fake::FailRuleWrite(0x2300); };
+const std::function<void()> kStoreFails = [] { kova_fake::FailRuleWrite(KOVA_ERR_STORE); };
+const std::function<void()> kNoList = [] { kova_fake::SetRuleListAnswer(RuleListAnswer::kNull); };
+const std::function<void()> kEmptyList = [] {
+  kova_fake::SetRuleListAnswer(RuleListAnswer::kEmptyHead);
+};
 
 // The in-process LUN API: the data it answers for each uuid; other uuids fail.
 std::map<std::string, Json::Value> gLuns;
 std::string gLunUser;
-
 void LunGet(KOVA::APIRequest* request, KOVA::APIResponse* response) {
   gLunUser = request->GetUser();
   auto lun = gLuns.find(request->GetParam("uuid", Json::Value()).asString());
@@ -45,19 +54,12 @@ void LunGet(KOVA::APIRequest* request, KOVA::APIResponse* response) {
   response->SetSuccess(lun->second);
 }
 
-APITableEntry kLunTable[] = {{"KOVA.Core.ISCSI.LUN", 1, "get", LunGet}, {}};
-
 class EventRuleTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    kova_fake::Reset();
-    gLuns.clear();
-    ASSERT_EQ(KOVA::APIRunner::Register(kLunTable, nullptr), 1);
-  }
-  void TearDown() override { KOVA::APIRunner::Unregister(kLunTable); }
+  void SetUp() override { kova_fake::Reset(); }
 };
 
-// Stores a rule with every field set, presets included.
+// Stores a rule with every field set; its presets differ from the written ones.
 void Seed(int type, const char* service, int enable = 1) {
   KOVAPERFEVENT_CONF_SETTING rule{
       {}, static_cast<KOVAPERFEVENT_EVENT_TYPE>(type), {}, 1, 2, 80, 1, 2, enable};
@@ -65,10 +67,9 @@ void Seed(int type, const char* service, int enable = 1) {
   kova_fake::AddRule(rule);
 }
 
-// The store's records, each as "id:type:service:resource:severity:threshold:
-// preset_a:preset_b:enable".
-std::vector<std::string> StoredRules() {
-  std::vector<std::string> rules;
+// The store as "id:type:service:resource:severity:threshold:preset_a:preset_b:enable".
+Strings StoredRules() {
+  Strings rules;
   for (const KOVAPERFEVENT_CONF_SETTING& r : kova_fake::Rules()) {
     char text[1300];
     snprintf(text, sizeof(text), "%s:%d:%s:%d:%d:%d:%d:%d:%d", r.id, r.type, r.service, r.resource,
@@ -78,368 +79,188 @@ std::vector<std::string> StoredRules() {
   return rules;
 }
 
-// Every list handed out was freed, and only once.
-void ExpectListsFreed(const std::string& label) {
-  EXPECT_EQ(kova_fake::OpenRuleLists(), 0) << label;
-  EXPECT_THAT(kova_fake::Calls(), Not(Contains("KOVAPerfEventConfListFree not open"))) << label;
-}
-
-// Lines logged at error priority of the default facility.
-std::vector<std::string> ErrorLog() {
-  std::vector<std::string> lines;
+// Lines logged at error priority, with source lines written as "N".
+Strings ErrorLog() {
+  Strings lines;
   for (const auto& line : kova_fake::Syslog()) {
-    if (line.priority == LOG_ERR) lines.push_back(line.text);
+    if (line.priority != LOG_ERR) continue;
+    lines.push_back(std::regex_replace(line.text, std::regex(":[0-9]+"), ":N"));
   }
   return lines;
 }
 
-TEST_F(EventRuleTest, TranslateNameShowsAServiceOrItsPackageByItsDisplayName) {
-  const std::string long_language = "abcdefghijklmnopqrstuvwxy";
-  const struct {
-    const char* service;
-    std::string language;
-    const char* display;                      // the service's display name, if any
-    std::map<std::string, std::string> info;  // keys of the package Foo's INFO file
-    const char* name;
-  } cases[] = {
-      {"smb", "enu", "File Service", {}, "File Service"},
-      {"smb", "enu", nullptr, {}, "smb"},
-      {"foo", "ger", "pkgctl-Foo", {{"displayname_ger", "DE"}, {"displayname", "Foo"}}, "DE"},
-      {"foo", "ger", "pkgctl-Foo", {{"displayname_enu", "EN"}, {"displayname", "Foo"}}, "Foo"},
-      {"foo", "ger", "pkgctl-Foo", {}, "pkgctl-Foo"},
-      {"foo", "enu", "Pkgctl-Foo", {{"displayname", "Foo"}}, "Pkgctl-Foo"},
-      // Without a display name the package's name, taken from the buffer, is empty.
-      {"pkgctl-Foo", "enu", nullptr, {{"displayname", "Foo"}}, "pkgctl-Foo"},
-      // The key holds 19 characters of the language code.
-      {"foo",
-       long_language,
-       "pkgctl-Foo",
-       {{"displayname_" + long_language, "Full"}, {"displayname", "Foo"}},
-       "Foo"},
-      {"foo", long_language, "pkgctl-Foo", {{"displayname_abcdefghijklmnopqrs", "Cut"}}, "Cut"},
-  };
-  for (const auto& c : cases) {
-    kova_fake::Reset();
-    if (c.display) kova_fake::SetServiceDisplayName(c.service, c.display);
-    for (const auto& [key, value] : c.info) kova_fake::SetConf(kInfo, key, value);
-    EXPECT_EQ(translateName(c.language, PERFEVENT_TYPE_SERVICE, c.service), c.name)
-        << c.service << " " << c.language;
-  }
+// Every list handed out was freed, and only once.
+void ExpectListsFreed(const std::string& label) {
+  EXPECT_EQ(kova_fake::OpenRuleLists(), 0) << label;
+  EXPECT_THAT(kova_fake::Calls(),
+              ::testing::Not(::testing::Contains("KOVAPerfEventConfListFree not open")))
+      << label;
 }
 
-TEST_F(EventRuleTest, TranslateNameShowsALunByItsNameAndOtherObjectsAsThemselves) {
-  const struct {
-    int type;
-    const char* uuid;
-    const char* data;  // what the LUN API answers for "u1"
-    const char* name;
-  } cases[] = {
-      {2, "u1", R"({"lun": {"name": "LUN 1"}})", "LUN 1"},
-      {2, "u2", R"({"lun": {"name": "LUN 1"}})", "u2"},
-      {2, "u1", "null", ""},
-      {2, "u1", R"({"lun": {}})", ""},
-      {2, "u1", R"({"lun": "LUN 1"})", ""},
-      {0, "u1", R"({"lun": {"name": "LUN 1"}})", "u1"},
-      {-1, "u1", R"({"lun": {"name": "LUN 1"}})", "u1"},
-      {3, "u1", R"({"lun": {"name": "LUN 1"}})", "u1"},
-      {1, "u1", R"({"lun": {"name": "LUN 1"}})", "u1"},
+TEST_F(EventRuleTest, TranslateNameFallsBackAtEachStep) {
+  const APITableEntry luns[] = {{"KOVA.Core.ISCSI.LUN", 1, "get", LunGet}, {}};
+  ASSERT_EQ(KOVA::APIRunner::Register(luns, nullptr), 1);
+  gLuns = {{"u1", ParseJson(R"({"lun": {"name": "LUN 1"}})")},
+           {"u3", ParseJson(R"({"lun": "LUN 1"})")}};
+  kova_fake::SetServiceDisplayName("smb", "File Service");
+  kova_fake::SetServiceDisplayName("foo", "pkgctl-Foo");
+  kova_fake::SetConf(kInfo, "displayname_ger", "DE");
+  kova_fake::SetConf(kInfo, "displayname", "Foo");
+  const std::string long_language = "abcdefghijklmnopqrstuvwxy";
+  kova_fake::SetConf(kInfo, "displayname_" + long_language, "Full");
+  kova_fake::SetConf(kInfo, "displayname_abcdefghijklmnopqrs", "Cut");
+  // type, object, language, display name
+  const std::tuple<int, const char*, std::string, const char*> cases[] = {
+      {1, "smb", "enu", "File Service"},
+      {1, "nfs", "enu", "nfs"},
+      {1, "foo", "ger", "DE"},
+      {1, "foo", "enu", "Foo"},
+      // Without a display name the package name comes from the empty buffer, and
+      // neither INFO key is found.
+      {1, "pkgctl-Foo", "enu", "pkgctl-Foo"},
+      // The key keeps 19 characters of the language.
+      {1, "foo", long_language, "Cut"},
+      {2, "u1", "enu", "LUN 1"},
+      {2, "u2", "enu", "u2"},
+      {2, "u3", "enu", ""},
+      {0, "smb", "enu", "smb"},
   };
-  for (const auto& c : cases) {
-    gLuns["u1"] = ParseJson(c.data);
-    EXPECT_EQ(translateName("enu", static_cast<KOVAPERFEVENT_EVENT_TYPE>(c.type), c.uuid), c.name)
-        << c.type << " " << c.data;
+  for (const auto& [type, object, language, name] : cases) {
+    EXPECT_EQ(translateName(language, static_cast<KOVAPERFEVENT_EVENT_TYPE>(type), object), name)
+        << object << " " << language;
   }
   EXPECT_EQ(gLunUser, "admin");
+  KOVA::APIRunner::Unregister(luns);
 }
 
 TEST_F(EventRuleTest, GetAnswersTheRuleObjectOnForExactlyOne) {
-  for (int enable : {1, 0, 2, -1}) {
+  for (int enable : {1, 2}) {
     kova_fake::Reset();
     Seed(0, "other");
     Seed(1, "foo", enable);
     kova_fake::SetServiceDisplayName("foo", "pkgctl-Foo");
     kova_fake::SetConf(kInfo, "displayname_ger", "Foo DE");
-    KOVA::APIResponse response = CallHandler(rule_get_v1, R"({"id": "2"})", "ger");
-    Json::Value expected = ParseJson(R"({"id": "2", "enable": false, "service": "foo",
+    Json::Value expected = ParseJson(R"({"id": "2", "enable": true, "service": "foo",
         "name": "Foo DE", "type": 1, "severity": 2, "resource": 1, "threshold": 80})");
     expected["enable"] = enable == 1;
-    EXPECT_EQ(response.GetData(), expected) << enable;
-    EXPECT_THAT(kova_fake::Calls(),
-                ElementsAre("KOVAPerfEventConfListGet 2",
-                            "QLIBCFileGetKeyValue /var/packages/Foo/INFO displayname_ger", kFree));
+    EXPECT_EQ(CallHandler(rule_get_v1, R"({"id": "2"})", "ger").GetData(), expected) << enable;
+    ExpectListsFreed("get");
   }
 }
 
-TEST_F(EventRuleTest, HandlersAnswer101ForParametersTheyCannotRead) {
-  std::vector<std::pair<APIHandler, std::string>> requests;
-  for (const char* params : {"{}", R"({"id": ""})", R"({"id": null})", R"({"id": 1})",
-                             R"({"id": ["1"]})", R"({"id": {}})"}) {
-    requests.push_back({rule_get_v1, params});
-  }
-  for (APIHandler handler : {rule_delete_v1, rule_onoff_v1}) {
-    for (const char* params : {"{}", R"({"id_list": null})", R"({"id_list": "1"})",
-                               R"({"id_list": 1})", R"({"id_list": {"id": "1"}})"}) {
-      requests.push_back({handler, params});
-    }
-  }
-  const struct {
-    APIHandler handler;
-    std::vector<std::string> names;
-    std::vector<std::string> values;
-  } groups[] = {
-      {rule_set_v1, {"id", "service"}, {"1", "true", "[]", "{}"}},
-      {rule_set_v1, {"enable"}, {"1", R"("true")", "[]", "{}"}},
-      {rule_set_v1,
-       {"type", "severity", "resource", "threshold"},
-       {R"("1")", "true", "1.5", "2147483648", "[]", "{}"}},
-      {rule_list_v1, {"offset", "limit"}, {R"("2")", "true", "1.5", "1e300", "[]", "{}"}},
-  };
-  for (const auto& group : groups) {
-    for (const std::string& name : group.names) {
-      for (const std::string& value : group.values) {
-        requests.push_back({group.handler, "{\"" + name + "\": " + value + "}"});
-      }
-    }
-  }
-  Seed(1, "smb");
-  for (const auto& [handler, params] : requests) {
-    KOVA::APIResponse response = CallHandler(handler, params);
-    EXPECT_EQ(response.GetErrorCode(), 101) << params;
-    EXPECT_TRUE(response.GetData().isNull()) << params;
-  }
-  EXPECT_THAT(kova_fake::Calls(), IsEmpty());
-}
-
-// The rule paths set only the record's code: the rest is what a Setting failure left.
-TEST_F(EventRuleTest, FailuresSetOnlyTheirCodeAndChangeNothing) {
+// Rules 1 (off) and 2 (on) are stored first and the daemon's reload fails. The
+// rule paths set only the record's code: the rest is what a Setting failure left.
+TEST_F(EventRuleTest, HandlersChangeTheStoreOrAnswerTheirCode) {
   kova_fake::SetVolumeLookup("pgsql", 1, "/volume1");
   ASSERT_EQ(CallHandler(set_v1, R"({"enable_history": true})").GetErrorCode(), 6104);
-  const auto duplicate = [] { kova_fake::FailRuleWrite(KOVA_ERR_PERFEVENT_DUPLICATE); };
-  const auto store_fails = [] { kova_fake::FailRuleWrite(KOVA_ERR_STORE); };
-  const auto no_list = [] { kova_fake::SetRuleListAnswer(RuleListAnswer::kNull); };
-  const auto empty_list = [] { kova_fake::SetRuleListAnswer(RuleListAnswer::kEmptyHead); };
-  const std::string get = "KOVAPerfEventConfListGet 1";
-  const struct {
-    APIHandler handler;
-    const char* params;
-    std::function<void()> arrange;
-    int code;
-    std::vector<std::string> calls;
-  } cases[] = {
-      {rule_get_v1, R"({"id": "9"})", [] {}, 6102, {"KOVAPerfEventConfListGet 9"}},
-      {rule_get_v1, R"({"id": "1"})", no_list, 6102, {get}},
-      {rule_get_v1, R"({"id": "1"})", empty_list, 6102, {get, kFree}},
-      {rule_set_v1, R"({"id": "9", "service": "x"})", [] {}, 6107, {}},
-      {rule_set_v1, R"({"service": "x"})", duplicate, 6106, {"KOVAPerfEventConfAdd"}},
-      {rule_set_v1, R"({"id": "1"})", duplicate, 6106, {get, "KOVAPerfEventConfSet 1", kFree}},
-      {rule_set_v1, R"({"service": "x"})", store_fails, 6102, {"KOVAPerfEventConfAdd"}},
-      {rule_set_v1, R"({"id": "1"})", store_fails, 6102, {get, "KOVAPerfEventConfSet 1", kFree}},
-      {rule_set_v1, R"({"id": "1"})", no_list, 6102, {get}},
-      {rule_set_v1, R"({"id": "1"})", empty_list, 6102, {get, kFree}},
+  const Json::Value earlier = ParseJson(R"({"err_line": 143, "err_msg": "PGSQL Disable",
+      "err_session": "error", "err_key": "db_connect_fail"})");
+  const std::string r1 = "1:0:x:1:2:80:1:2:0", r2 = "2:0:x:1:2:80:1:2:1", s200(200, 's');
+  const std::string switched_1 = "1:0:x:1:2:80:1:2:1", switched_2 = "2:0:x:1:2:80:1:2:0";
+  const std::string id1 = R"({"id": "1"})";
+  const Strings seeded = {r1, r2}, reload_failed = {kReloadFailed};
+  const std::string full = R"({"service": ")" + s200 + R"(", "type": 1, "severity": 2,
+      "resource": 3, "threshold": 90, "enable": true})";
+  const std::string created = "3:1:" + s200.substr(0, 127) + ":3:2:90:5:30:1";
+  const char* ids = R"({"id_list": [12, "1", null, "9", {"id": "2"}, ["2"], "1"]})";
+  const char* both = R"({"id_list": [{"id": "1", "enable": true}, {"id": "2", "enable": false}]})";
+  const char* mixed = R"({"id_list": [{"id": "1", "enable": true}, {"id": "2"}, {"enable": false},
+      "2", {"id": 1, "enable": false}, {"id": "1", "enable": 0}, {"id": "9", "enable": false},
+      {"id": "2", "enable": false}]})";
+  Strings invalid(5, "EventRule:N obj is not valid, it should contain 'id' & 'enable'");
+  invalid.push_back(kReloadFailed);
+  const Strings failed = {"EventRule:N Failed to enable [1]'s enable (true)",
+                          "EventRule:N Failed to enable [2]'s enable (false)", kReloadFailed};
+  const std::string get2 = "KOVAPerfEventConfListGet 2";
+  const Strings change = {get2, "KOVAPerfEventConfSet 2", kReload, kFree};
+  const Strings walk = {kGet1, kSet1, kFree, get2, "KOVAPerfEventConfSet 2", kFree, kReload};
+  const Strings empty_walk = {kGet1, kFree, get2, kFree, kReload};
+  // handler, params, arrangement, code (0: success), calls, store, error log
+  using Case =
+      std::tuple<APIHandler, std::string, std::function<void()>, int, Strings, Strings, Strings>;
+  const Case cases[] = {
+      // Parameters the handler can't read: 101 with null data, nothing called.
+      {rule_get_v1, "{}", kAsIs, 101, {}, seeded, {}},
+      {rule_get_v1, R"({"id": ""})", kAsIs, 101, {}, seeded, {}},
+      {rule_get_v1, R"({"id": 1})", kAsIs, 101, {}, seeded, {}},
+      {rule_delete_v1, "{}", kAsIs, 101, {}, seeded, {}},
+      {rule_delete_v1, R"({"id_list": "1"})", kAsIs, 101, {}, seeded, {}},
+      {rule_onoff_v1, R"({"id_list": {"id": "1", "enable": true}})", kAsIs, 101, {}, seeded, {}},
+      {rule_set_v1, R"({"id": 1})", kAsIs, 101, {}, seeded, {}},
+      {rule_set_v1, R"({"enable": "true"})", kAsIs, 101, {}, seeded, {}},
+      {rule_set_v1, R"({"type": 1.5})", kAsIs, 101, {}, seeded, {}},
+      {rule_set_v1, R"({"threshold": 2147483648})", kAsIs, 101, {}, seeded, {}},
+      {rule_list_v1, R"({"offset": "2"})", kAsIs, 101, {}, seeded, {}},
+      {rule_list_v1, R"({"limit": 1.5})", kAsIs, 101, {}, seeded, {}},
+      {rule_get_v1, R"({"id": "9"})", kAsIs, 6102, {"KOVAPerfEventConfListGet 9"}, seeded, {}},
+      {rule_get_v1, id1, kEmptyList, 6102, {kGet1, kFree}, seeded, {}},
+      {rule_set_v1, R"({"id": "9", "service": "x"})", kAsIs, 6107, {}, seeded, {}},
+      {rule_set_v1, R"({"service": "x"})", kDuplicate, 6106, {kAdd}, seeded, {}},
+      {rule_set_v1, id1, kStoreFails, 6102, {kGet1, kSet1, kFree}, seeded, {}},
+      {rule_set_v1, id1, kNoList, 6102, {kGet1}, seeded, {}},
+      {rule_set_v1, id1, kEmptyList, 6102, {kGet1, kFree}, seeded, {}},
+      {rule_set_v1, "{}", kAsIs, 0, {kAdd, kReload}, {r1, r2, "3:0::0:0:0:5:30:0"}, reload_failed},
+      {rule_set_v1, full, kAsIs, 0, {kAdd, kReload}, {r1, r2, created}, reload_failed},
+      // A change writes absent parameters as 0, empty or off.
+      {rule_set_v1, R"({"id": "2"})", kAsIs, 0, change, {r1, "2:0::0:0:0:5:30:0"}, reload_failed},
+      {rule_delete_v1, ids, kAsIs, 0, {"KOVAPerfEventConfDelete 1", kReload}, {r2}, reload_failed},
+      {rule_delete_v1, R"({"id_list": []})", kAsIs, 0, {kReload}, seeded, reload_failed},
+      {rule_onoff_v1, mixed, kAsIs, 0, walk, {switched_1, switched_2}, invalid},
+      {rule_onoff_v1, both, kStoreFails, 0, walk, seeded, failed},
+      {rule_onoff_v1, both, kNoList, 0, {kGet1, get2, kReload}, seeded, reload_failed},
+      {rule_onoff_v1, both, kEmptyList, 0, empty_walk, seeded, reload_failed},
   };
-  for (const auto& c : cases) {
+  for (const auto& [handler, params, arrange, code, calls, stored, log] : cases) {
     kova_fake::Reset();
-    Seed(1, "smb");
-    const std::vector<std::string> before = StoredRules();
-    c.arrange();
-    KOVA::APIResponse response = CallHandler(c.handler, c.params);
-    EXPECT_EQ(response.GetErrorCode(), c.code) << c.params;
-    EXPECT_EQ(response.GetData(), ParseJson(R"({"err_line": 143, "err_msg": "PGSQL Disable",
-        "err_session": "error", "err_key": "db_connect_fail"})"))
-        << c.params;
-    EXPECT_THAT(kova_fake::Calls(), ElementsAreArray(c.calls)) << c.params;
-    EXPECT_EQ(StoredRules(), before) << c.params;
-    ExpectListsFreed(c.params);
-  }
-}
-
-// Rule "1" is stored beforehand; a create adds rule "2".
-TEST_F(EventRuleTest, SetWritesEveryFieldOnCreateAndChange) {
-  const std::string long_service(200, 's');
-  const struct {
-    std::string params;
-    std::string stored;
-  } cases[] = {
-      {"{}", "2:0::0:0:0:5:30:0"},
-      {R"({"id": null, "service": null, "type": null, "enable": null})", "2:0::0:0:0:5:30:0"},
-      {R"({"service": "nfs", "type": 1, "severity": 2, "resource": 3, "threshold": 90,
-          "enable": true})",
-       "2:1:nfs:3:2:90:5:30:1"},
-      {R"({"id": "1"})", "1:0::0:0:0:5:30:0"},
-      {R"({"id": "1", "service": "iscsi", "type": 7, "severity": -1, "resource": 4,
-          "threshold": 2.0, "enable": false})",
-       "1:7:iscsi:4:-1:2:5:30:0"},
-      {R"({"id": "1", "service": ")" + long_service + "\"}",
-       "1:0:" + long_service.substr(0, 127) + ":0:0:0:5:30:0"},
-  };
-  for (const auto& c : cases) {
-    kova_fake::Reset();
-    Seed(1, "smb");
-    KOVA::APIResponse response = CallHandler(rule_set_v1, c.params);
-    EXPECT_EQ(response.GetSettleCount(), 1);
-    EXPECT_EQ(response.GetState(), KOVA::APIResponse::State::kSuccess) << c.params;
-    EXPECT_TRUE(response.GetData().isNull());
-    const bool change = c.stored[0] == '1';
-    std::vector<std::string> stored{c.stored};
-    if (!change) stored.insert(stored.begin(), "1:1:smb:1:2:80:1:2:1");
-    EXPECT_EQ(StoredRules(), stored) << c.params;
-    const std::vector<std::string> calls =
-        change ? std::vector<std::string>{"KOVAPerfEventConfListGet 1", "KOVAPerfEventConfSet 1",
-                                          kReload, kFree}
-               : std::vector<std::string>{"KOVAPerfEventConfAdd", kReload};
-    EXPECT_THAT(kova_fake::Calls(), ElementsAreArray(calls)) << c.params;
-    ExpectListsFreed(c.params);
-  }
-}
-
-TEST_F(EventRuleTest, DeleteSkipsWhatIsNoStoredId) {
-  for (const char* service : {"a", "b", "c"}) Seed(0, service);
-  EXPECT_EQ(CallHandler(rule_delete_v1,
-                        R"({"id_list": [12, "1", null, "9", {"id": "2"}, ["3"], "3", "1"]})")
-                .GetState(),
-            KOVA::APIResponse::State::kSuccess);
-  EXPECT_THAT(kova_fake::Calls(),
-              ElementsAre("KOVAPerfEventConfDelete 1", "KOVAPerfEventConfDelete 3", kReload));
-  ASSERT_EQ(kova_fake::Rules().size(), 1u);
-  EXPECT_STREQ(kova_fake::Rules()[0].id, "2");
-}
-
-TEST_F(EventRuleTest, OnOffSwitchesOnlyValidElementsOfStoredRules) {
-  Seed(0, "a", 0);
-  Seed(0, "b", 1);
-  Seed(0, "c", 1);
-  KOVA::APIResponse response = CallHandler(rule_onoff_v1, R"({"id_list": [
-      {"id": "1", "enable": true}, {"id": "2"}, {"enable": false}, "3", 3, null, [],
-      {"id": 3, "enable": false}, {"id": "3", "enable": 0}, {"id": "9", "enable": false},
-      {"id": "2", "enable": false}]})");
-  EXPECT_EQ(response.GetState(), KOVA::APIResponse::State::kSuccess);
-  EXPECT_THAT(StoredRules(),
-              ElementsAre("1:0:a:1:2:80:1:2:1", "2:0:b:1:2:80:1:2:0", "3:0:c:1:2:80:1:2:1"));
-  EXPECT_THAT(kova_fake::Calls(),
-              ElementsAre("KOVAPerfEventConfListGet 1", "KOVAPerfEventConfSet 1", kFree,
-                          "KOVAPerfEventConfListGet 2", "KOVAPerfEventConfSet 2", kFree, kReload));
-  const std::vector<std::string> log = ErrorLog();
-  EXPECT_EQ(log.size(), 8u);
-  EXPECT_THAT(
-      log,
-      Each(MatchesRegex("EventRule:[0-9]+ obj is not valid, it should contain 'id' & 'enable'")));
-}
-
-TEST_F(EventRuleTest, OnOffGoesOnAfterARuleItCannotSwitch) {
-  const struct {
-    std::function<void()> arrange;
-    std::vector<std::string> log;
-  } cases[] = {
-      {[] { kova_fake::FailRuleWrite(KOVA_ERR_STORE); },
-       {"EventRule:[0-9]+ Failed to enable \\[1\\]'s enable \\(true\\)",
-        "EventRule:[0-9]+ Failed to enable \\[2\\]'s enable \\(false\\)"}},
-      {[] { kova_fake::SetRuleListAnswer(RuleListAnswer::kNull); }, {}},
-      {[] { kova_fake::SetRuleListAnswer(RuleListAnswer::kEmptyHead); }, {}},
-  };
-  for (const auto& c : cases) {
-    kova_fake::Reset();
-    Seed(0, "a", 0);
-    Seed(0, "b", 1);
-    c.arrange();
-    const std::vector<std::string> before = StoredRules();
-    CallHandler(rule_onoff_v1,
-                R"({"id_list": [{"id": "1", "enable": true}, {"id": "2", "enable": false}]})");
-    EXPECT_EQ(StoredRules(), before);
-    const std::vector<std::string> log = ErrorLog();
-    ASSERT_EQ(log.size(), c.log.size());
-    for (size_t i = 0; i < log.size(); ++i) EXPECT_THAT(log[i], MatchesRegex(c.log[i]));
-    const auto& calls = kova_fake::Calls();
-    EXPECT_EQ(std::count(calls.begin(), calls.end(), "KOVAPerfEventConfListGet 2"), 1);
-    EXPECT_EQ(calls.back(), kReload);
-    ExpectListsFreed(std::to_string(c.log.size()));
-  }
-}
-
-TEST_F(EventRuleTest, WritersReloadOnceAndOnlyLogAFailedReload) {
-  const struct {
-    APIHandler handler;
-    const char* params;
-  } cases[] = {
-      {rule_set_v1, "{}"},
-      {rule_set_v1, R"({"id": "1", "enable": true})"},
-      {rule_delete_v1, R"({"id_list": ["1", "1"]})"},
-      {rule_delete_v1, R"({"id_list": []})"},
-      {rule_onoff_v1, R"({"id_list": [{"id": "1", "enable": false}, {"id": "1"}]})"},
-  };
-  for (const auto& c : cases) {
-    kova_fake::Reset();
-    Seed(0, "a");
+    Seed(0, "x", 0);
+    Seed(0, "x", 1);
     kova_fake::FailService("kovaperfeventd", "reload", -1);
-    EXPECT_EQ(CallHandler(c.handler, c.params).GetState(), KOVA::APIResponse::State::kSuccess)
-        << c.params;
-    const auto& calls = kova_fake::Calls();
-    EXPECT_EQ(std::count(calls.begin(), calls.end(), kReload), 1) << c.params;
-    const std::vector<std::string> log = ErrorLog();
-    ASSERT_FALSE(log.empty()) << c.params;
-    EXPECT_THAT(log.back(), MatchesRegex("EventRule:[0-9]+ Failed to reload kovaperfeventd "
-                                         "\\[0x1001 fake_system.cc:[0-9]+\\]"));
+    arrange();
+    KOVA::APIResponse response = CallHandler(handler, params);
+    EXPECT_EQ(response.GetSettleCount(), 1) << params;
+    EXPECT_EQ(response.GetErrorCode(), code) << params;
+    EXPECT_EQ(response.GetData(), code == 0 || code == 101 ? Json::Value() : earlier) << params;
+    EXPECT_THAT(kova_fake::Calls(), ::testing::ElementsAreArray(calls)) << params;
+    EXPECT_EQ(StoredRules(), stored) << params;
+    EXPECT_EQ(ErrorLog(), log) << params;
+    ExpectListsFreed(params);
   }
 }
 
-TEST_F(EventRuleTest, ListCutsThePageAndCountsAllRules) {
-  const struct {
-    const char* params;
-    std::vector<std::string> ids;
-  } cases[] = {
-      {"{}", {"1", "2", "3", "4", "5"}},
-      {R"({"offset": 2, "limit": 3})", {"3", "4", "5"}},
-      {R"({"offset": 1, "limit": 2})", {"2", "3"}},
-      {R"({"offset": 4, "limit": 10})", {"5"}},
-      {R"({"limit": 0})", {}},
-      {R"({"offset": 5})", {}},
-      {R"({"offset": 6, "limit": 1})", {}},
-      {R"({"offset": -1})", {}},
-      {R"({"offset": 1e12})", {}},
-      {R"({"offset": 3.0, "limit": -7})", {"4", "5"}},
-      {R"({"offset": null, "limit": null})", {"1", "2", "3", "4", "5"}},
+// Five rules are stored and the support switch is "yes" unless a case says otherwise.
+TEST_F(EventRuleTest, ListCutsThePageCountsAllRulesAndPassesSupportThrough) {
+  const auto support_off = [] { kova_fake::SetConf(kKovaInfoConf, kSupportKey, "no"); };
+  const auto unreadable = [] { kova_fake::FailConfRead(kKovaInfoConf, -2); };
+  // params, arrangement, "total", ids on the page, "support_internal"
+  const std::tuple<const char*, std::function<void()>, unsigned, Strings, int> cases[] = {
+      {"{}", kAsIs, 5, {"1", "2", "3", "4", "5"}, 1},
+      {R"({"offset": 1, "limit": 3})", support_off, 5, {"2", "3", "4"}, 0},
+      {R"({"limit": 0})", unreadable, 5, {}, -2},
+      {R"({"offset": 5})", kAsIs, 5, {}, 1},
+      {R"({"offset": -1})", kAsIs, 5, {}, 1},
+      {R"({"offset": 3.0, "limit": -7})", kAsIs, 5, {"4", "5"}, 1},
+      {"{}", kNoList, 0, {}, 1},
+      {"{}", kEmptyList, 0, {}, 1},
   };
-  for (const char* service : {"a", "b", "c", "d", "e"}) Seed(0, service);
-  kova_fake::SetConf("/etc/kovainfo.conf", kSupportKey, "yes");
-  for (const auto& c : cases) {
-    const Json::Value data = CallHandler(rule_list_v1, c.params).GetData();
-    EXPECT_EQ(data["total"].type(), Json::uintValue);
-    EXPECT_EQ(data["total"].asUInt(), 5u) << c.params;
-    EXPECT_TRUE(data["rules"].isArray()) << c.params;
-    std::vector<std::string> ids;
-    for (const Json::Value& rule : data["rules"]) ids.push_back(rule["id"].asString());
-    EXPECT_EQ(ids, c.ids) << c.params;
-    EXPECT_EQ(data["support_internal"], 1);
-  }
-  ExpectListsFreed("list");
-}
-
-TEST_F(EventRuleTest, ListPassesSupportThroughAndShowsNoRulesFromAnEmptyAnswer) {
-  const struct {
-    const char* support;  // the stored switch; null: reading the file fails
-    RuleListAnswer answer;
-    int support_internal;
-  } cases[] = {
-      {"no", RuleListAnswer::kRules, 0},
-      {"Yes", RuleListAnswer::kNull, 0},
-      {nullptr, RuleListAnswer::kEmptyHead, -2},
-  };
-  for (const auto& c : cases) {
+  for (const auto& [params, arrange, total, ids, support] : cases) {
     kova_fake::Reset();
-    Seed(0, "a");
-    kova_fake::SetRuleListAnswer(c.answer);
-    if (c.support) kova_fake::SetConf("/etc/kovainfo.conf", kSupportKey, c.support);
-    if (!c.support) kova_fake::FailConfRead("/etc/kovainfo.conf", -2);
-    const Json::Value data = CallHandler(rule_list_v1, R"({"offset": 1})").GetData();
-    EXPECT_EQ(data["total"].asUInt(), c.answer == RuleListAnswer::kRules ? 1u : 0u);
-    EXPECT_EQ(data["rules"], Json::Value(Json::arrayValue));
-    EXPECT_EQ(data["support_internal"], c.support_internal);
-    ExpectListsFreed(std::to_string(c.support_internal));
+    for (const char* service : {"a", "b", "c", "d", "e"}) Seed(0, service);
+    kova_fake::SetConf(kKovaInfoConf, kSupportKey, "yes");
+    arrange();
+    const Json::Value data = CallHandler(rule_list_v1, params).GetData();
+    EXPECT_EQ(data["total"], Json::Value(total)) << params;
+    EXPECT_TRUE(data["rules"].isArray()) << params;
+    Strings page;
+    for (const Json::Value& rule : data["rules"]) page.push_back(rule["id"].asString());
+    EXPECT_EQ(page, ids) << params;
+    EXPECT_EQ(data["support_internal"], support) << params;
+    ExpectListsFreed(params);
   }
   // The reader appends to what the vector holds.
   kova_fake::SetRuleListAnswer(RuleListAnswer::kRules);
   std::vector<Json::Value> rules{Json::Value("kept")};
   ListEventRules("enu", rules);
-  ASSERT_EQ(rules.size(), 2u);
+  EXPECT_EQ(rules.size(), 6u);
   EXPECT_EQ(rules[0], "kept");
 }
 
@@ -452,7 +273,7 @@ TEST_F(EventRuleTest, WritersRaiseTheProcessAndReadersDoNot) {
     ASSERT_EQ(setresuid(-1, 65534, -1), 0);
     CallHandler(rule_list_v1);
     CallHandler(rule_get_v1, R"({"id": "1"})");
-    EXPECT_THAT(kova_fake::Syslog(), IsEmpty());
+    EXPECT_THAT(kova_fake::Syslog(), ::testing::IsEmpty());
     CallHandler(rule_set_v1, R"({"id": "1", "enable": true})");
     CallHandler(rule_set_v1, "{}");
     CallHandler(rule_onoff_v1, R"({"id_list": [{"id": "1", "enable": false}]})");

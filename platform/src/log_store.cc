@@ -170,6 +170,48 @@ int AppendLogRecords(int type, const std::vector<LogRecord>& records) {
   return 0;
 }
 
+int DumpLogRecords(int type, int fd) {
+  if (StoreName(type) == nullptr) {
+    KOVA_SET_ERROR(KOVA_ERR_NOT_FOUND);
+    return -1;
+  }
+  RootScope root;
+  Database db;
+  bool missing = false;
+  if (!db.Open(StorePath(type), false, nullptr, &missing)) {
+    if (missing) return 0;  // a log never written has no records
+    KOVA_SET_ERROR(KOVA_ERR_STORE);
+    return -1;
+  }
+  Statement select(db, "SELECT id, level, time, user, source, event FROM records ORDER BY id");
+  auto output = std::make_unique<Output>(fd);
+  LogTimeFormatter times;
+  char id[24];
+  char time_text[32];
+  int step;
+  while ((step = select.Step()) == SQLITE_ROW) {
+    const int id_length = snprintf(id, sizeof(id), "%lld", static_cast<long long>(select.Int(0)));
+    output->Put(std::string_view(id, id_length));
+    output->Put('\t');
+    output->Put(select.Text(1));
+    output->Put('\t');
+    output->Put(std::string_view(time_text, times.Format(select.Int(2), time_text)));
+    output->Put('\t');
+    output->Put(select.Text(3));
+    output->Put('\t');
+    output->Put(select.Text(4));
+    output->Put('\t');
+    output->Put(select.Text(5));
+    output->Put('\n');
+  }
+  output->Flush();
+  if (step != SQLITE_DONE || !output->ok()) {
+    KOVA_SET_ERROR(step != SQLITE_DONE ? KOVA_ERR_STORE : KOVA_ERR_IO);
+    return -1;
+  }
+  return 0;
+}
+
 }  // namespace kova
 
 int KOVALogFilePathGet(int type, char* path, size_t size) {
@@ -198,43 +240,12 @@ int KOVALogGet1(int type, const char* out_path, const char* language) {
     KOVA_SET_ERROR(errno == EACCES ? KOVA_ERR_PERMISSION : KOVA_ERR_IO);
     return -1;
   }
-  kova::Database db;
-  bool missing = false;
-  if (!db.Open(kova::StorePath(type), false, nullptr, &missing)) {
-    close(fd);
-    if (missing) return 0;  // a log never written has no records
-    KOVA_SET_ERROR(KOVA_ERR_STORE);
+  const int result = kova::DumpLogRecords(type, fd);
+  if (close(fd) != 0 && result == 0) {
+    KOVA_SET_ERROR(KOVA_ERR_IO);
     return -1;
   }
-  kova::Statement select(db,
-                         "SELECT id, level, time, user, source, event FROM records ORDER BY id");
-  auto output = std::make_unique<kova::Output>(fd);
-  kova::LogTimeFormatter times;
-  char id[24];
-  char time_text[32];
-  int step;
-  while ((step = select.Step()) == SQLITE_ROW) {
-    const int id_length = snprintf(id, sizeof(id), "%lld", static_cast<long long>(select.Int(0)));
-    output->Put(std::string_view(id, id_length));
-    output->Put('\t');
-    output->Put(select.Text(1));
-    output->Put('\t');
-    output->Put(std::string_view(time_text, times.Format(select.Int(2), time_text)));
-    output->Put('\t');
-    output->Put(select.Text(3));
-    output->Put('\t');
-    output->Put(select.Text(4));
-    output->Put('\t');
-    output->Put(select.Text(5));
-    output->Put('\n');
-  }
-  output->Flush();
-  const bool ok = step == SQLITE_DONE && output->ok();
-  if (close(fd) != 0 || !ok) {
-    KOVA_SET_ERROR(step == SQLITE_DONE ? KOVA_ERR_IO : KOVA_ERR_STORE);
-    return -1;
-  }
-  return 0;
+  return result;
 }
 
 int KOVALogClean(int type) {

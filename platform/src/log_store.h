@@ -31,6 +31,10 @@ struct LogRecord {
 // source, or a store that can't be written.
 int AppendLogRecords(int type, const std::vector<LogRecord>& records);
 
+// Writes every record of log `type`, oldest first, as the lines of KOVALogGet1
+// to the open file `fd`. Returns 0, or -1 with the last platform error set.
+int DumpLogRecords(int type, int fd);
+
 // Formats times as KOVALogConvertTime1 does, remembering the minute it did
 // last, so that a run of records from one minute costs one conversion.
 class LogTimeFormatter {

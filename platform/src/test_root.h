@@ -11,10 +11,9 @@
 
 #include <cstdio>
 #include <cstdlib>
+#include <filesystem>
 #include <fstream>
 #include <string>
-
-#include "src/system_root.h"
 
 namespace kova {
 
@@ -29,7 +28,9 @@ class TestRoot {
     path_ = pattern;
     chmod(pattern, 0755);  // for tests that run part of their work as another user
     setenv("KOVA_ROOT", path_.c_str(), 1);
-    for (const char* dir : {"/etc", "/tmp", "/run", "/var"}) MakeDirectories(Path(dir), 0755);
+    for (const char* dir : {"/etc", "/tmp", "/run", "/var"}) {
+      std::filesystem::create_directories(Path(dir));
+    }
     chmod(Path("/tmp").c_str(), 01777);
   }
   ~TestRoot() {
@@ -49,7 +50,8 @@ class TestRoot {
   // Writes `content` to the system path `system_path`, making its directories.
   void Write(const std::string& system_path, const std::string& content, mode_t mode = 0644) const {
     const std::string real = Path(system_path);
-    MakeDirectories(real.substr(0, real.rfind('/')), 0755);
+    std::error_code ignored;
+    std::filesystem::create_directories(real.substr(0, real.rfind('/')), ignored);
     std::ofstream(real, std::ios::trunc) << content;
     chmod(real.c_str(), mode);
   }

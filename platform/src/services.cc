@@ -1,0 +1,200 @@
+// Services: descriptions, start, stop, reload and state.
+
+#include "src/services.h"
+
+#include <dirent.h>
+#include <errno.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdio>
+#include <cstring>
+#include <string_view>
+
+#include "kova/error.h"
+#include "kova/service.h"
+#include "src/atomic_file.h"
+#include "src/conf_file.h"
+#include "src/privilege.h"
+#include "src/service_process.h"
+#include "src/system_root.h"
+
+namespace kova {
+namespace {
+
+constexpr char kServicesDir[] = "/etc/kova/services/";
+constexpr char kRunDir[] = "/run/kova";
+constexpr char kPackagePrefix[] = "pkgctl-";
+constexpr auto kStopGrace = std::chrono::milliseconds(5000);
+
+std::string DescriptionPath(const std::string& name) {
+  return RootPath(kServicesDir + name + ".conf");
+}
+
+std::string PidPath(const std::string& name) {
+  return RootPath(std::string(kRunDir) + "/" + name + ".pid");
+}
+
+bool IsDirectory(const std::string& path) {
+  struct stat info;
+  return stat(path.c_str(), &info) == 0 && S_ISDIR(info.st_mode);
+}
+
+// The recorded process of service `name`; false when none is recorded.
+bool ReadPidFile(const std::string& name, ProcessIdentity& process) {
+  std::string text;
+  if (!ReadWholeFile(PidPath(name), text)) return false;
+  long long pid = 0;
+  return sscanf(text.c_str(), "%lld %llu", &pid, &process.start_time) == 2 && pid > 0 &&
+         (process.pid = static_cast<pid_t>(pid)) == pid;
+}
+
+bool IsRunning(const std::string& name) {
+  ProcessIdentity process;
+  return ReadPidFile(name, process) && IsAlive(process);
+}
+
+// Records `error` where it happened and fails with -1.
+#define FAILED(error) (KOVA_SET_ERROR(error), -1)
+
+// Checks the name and makes the directory of the records; the platform error
+// when either fails.
+int Prepare(const std::string& name) {
+  if (!IsPlainName(name)) return KOVA_ERR_INVALID;
+  if (!MakeDirectories(RootPath(kRunDir), 0755)) return KOVA_ERR_IO;
+  return 0;
+}
+
+int Start(const std::string& name) {
+  if (int error = Prepare(name)) return FAILED(error);
+  FileLock lock(PidPath(name));
+  if (!lock.locked()) return FAILED(KOVA_ERR_IO);
+  if (IsRunning(name)) return 0;
+  ServiceDescription description;
+  const int known = DescribeService(name, description);
+  if (known <= 0) return -1;
+  std::vector<std::string> argv;
+  if (description.command.empty() || !SplitCommand(description.command, argv) ||
+      argv[0][0] != '/') {
+    return FAILED(description.command.empty() ? KOVA_ERR_SERVICE_UNKNOWN : KOVA_ERR_FORMAT);
+  }
+  const std::vector<std::string> env = {
+      "PATH=/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin", "LANG=C.UTF-8",
+      "KOVA_ROOT=" + SystemRoot()};
+  ProcessIdentity process;
+  if (!LaunchDetached(argv, env, process)) return FAILED(KOVA_ERR_SERVICE_FAILED);
+  const std::string record =
+      std::to_string(process.pid) + " " + std::to_string(process.start_time) + "\n";
+  if (!ReplaceFile(PidPath(name), record, 0644)) {
+    Terminate(process, kStopGrace);
+    return FAILED(KOVA_ERR_IO);
+  }
+  return 0;
+}
+
+int Stop(const std::string& name) {
+  if (int error = Prepare(name)) return FAILED(error);
+  FileLock lock(PidPath(name));
+  if (!lock.locked()) return FAILED(KOVA_ERR_IO);
+  ProcessIdentity process;
+  const bool recorded = ReadPidFile(name, process);
+  ServiceDescription description;
+  if (!recorded && DescribeService(name, description) <= 0) return -1;
+  if (recorded && !Terminate(process, kStopGrace)) {
+    return FAILED(errno == EPERM ? KOVA_ERR_PERMISSION : KOVA_ERR_SERVICE_FAILED);
+  }
+  if (unlink(PidPath(name).c_str()) != 0 && errno != ENOENT) return FAILED(KOVA_ERR_IO);
+  return 0;
+}
+
+int Reload(const std::string& name) {
+  if (!IsPlainName(name)) return FAILED(KOVA_ERR_INVALID);
+  ServiceDescription description;
+  if (DescribeService(name, description) <= 0) return -1;
+  ProcessIdentity process;
+  if (!ReadPidFile(name, process) || !IsAlive(process)) return FAILED(KOVA_ERR_SERVICE_FAILED);
+  if (kill(process.pid, SIGHUP) != 0) {
+    return FAILED(errno == EPERM ? KOVA_ERR_PERMISSION : KOVA_ERR_SERVICE_FAILED);
+  }
+  return 0;
+}
+
+}  // namespace
+
+int DescribeService(const std::string& name, ServiceDescription& description) {
+  if (!IsPlainName(name)) {
+    KOVA_SET_ERROR(KOVA_ERR_INVALID);
+    return 0;
+  }
+  description = ServiceDescription{name, "", name, ""};
+  const std::string path = DescriptionPath(name);
+  if (access(path.c_str(), F_OK) != 0) {
+    const std::string package = name.substr(std::min(name.size(), sizeof(kPackagePrefix) - 1));
+    if (name.rfind(kPackagePrefix, 0) == 0 && !package.empty() &&
+        IsDirectory(RootPath("/var/packages/" + package))) {
+      description.package = package;
+      return 1;
+    }
+    KOVA_SET_ERROR(KOVA_ERR_SERVICE_UNKNOWN);
+    return 0;
+  }
+  for (auto [key, field] : {std::pair{"command", &description.command},
+                            std::pair{"display_name", &description.display_name},
+                            std::pair{"package", &description.package}}) {
+    if (ConfRead(path, key, *field) < 0) return -1;
+  }
+  if (description.display_name.empty()) description.display_name = name;
+  return 1;
+}
+
+std::vector<std::string> ListServices() {
+  std::vector<std::string> names;
+  DIR* dir = opendir(RootPath(kServicesDir).c_str());
+  if (dir == nullptr) return names;
+  while (const dirent* entry = readdir(dir)) {
+    std::string_view file = entry->d_name;
+    constexpr std::string_view kSuffix = ".conf";
+    if (file.size() > kSuffix.size() && file.substr(file.size() - kSuffix.size()) == kSuffix) {
+      const std::string name(file.substr(0, file.size() - kSuffix.size()));
+      if (IsPlainName(name)) names.push_back(name);
+    }
+  }
+  closedir(dir);
+  std::sort(names.begin(), names.end());
+  return names;
+}
+
+}  // namespace kova
+
+int QLIBServiceIsRunning(const char* name) {
+  return name != nullptr && kova::IsPlainName(name) && kova::IsRunning(name) ? 1 : 0;
+}
+
+int QLIBServiceStart(const char* name, int) {
+  if (name == nullptr) return FAILED(KOVA_ERR_INVALID);
+  kova::RootScope root;
+  return kova::Start(name);
+}
+
+int QLIBServiceStop(const char* name, int) {
+  if (name == nullptr) return FAILED(KOVA_ERR_INVALID);
+  kova::RootScope root;
+  return kova::Stop(name);
+}
+
+int QLIBServiceReload(const char* name) {
+  if (name == nullptr) return FAILED(KOVA_ERR_INVALID);
+  kova::RootScope root;
+  return kova::Reload(name) == 0 ? 0 : -1;
+}
+
+int QLIBServicecfgDisplayNameGet(const char* name, char* display, size_t size) {
+  if (name == nullptr || display == nullptr || size == 0) return FAILED(KOVA_ERR_INVALID);
+  kova::ServiceDescription description;
+  if (kova::DescribeService(name, description) <= 0) return -1;
+  if (description.display_name.size() >= size) return FAILED(KOVA_ERR_INVALID);
+  memcpy(display, description.display_name.c_str(), description.display_name.size() + 1);
+  return 0;
+}

@@ -1,0 +1,39 @@
+// System services, as the platform describes and runs them.
+//
+// A service is described by /etc/kova/services/<name>.conf (under the system
+// root), a configuration file with the keys
+//   command       the program's absolute path and its arguments (double quotes
+//                 group words); the program runs in the foreground, with the
+//                 environment PATH, LANG and KOVA_ROOT
+//   display_name  the name shown to users (default: the service's name)
+//   package       the package the service belongs to, if any
+// A started service is recorded in /run/kova/<name>.pid as "<pid> <start time>".
+// The service of a package <pkg> is "pkgctl-<pkg>"; it is known to the system
+// while /var/packages/<pkg> exists, even without a file of its own.
+
+#ifndef KOVA_PLATFORM_SRC_SERVICES_H_
+#define KOVA_PLATFORM_SRC_SERVICES_H_
+
+#include <string>
+#include <vector>
+
+namespace kova {
+
+struct ServiceDescription {
+  std::string name;
+  std::string command;
+  std::string display_name;
+  std::string package;
+};
+
+// Reads the description of service `name`. Returns 1 when the service is known,
+// 0 when it is not (or the name can't be a service's), -1 when its file can't
+// be read; the last platform error says why on 0 and -1.
+int DescribeService(const std::string& name, ServiceDescription& description);
+
+// The names of the described services, sorted.
+std::vector<std::string> ListServices();
+
+}  // namespace kova
+
+#endif  // KOVA_PLATFORM_SRC_SERVICES_H_

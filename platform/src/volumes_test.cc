@@ -1,0 +1,38 @@
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include "kova/error.h"
+#include "kova/service.h"
+#include "src/test_root.h"
+
+namespace {
+
+TEST(VolumesTest, FollowsShareLinksIntoVolumes) {
+  kova::TestRoot root;
+  kova::MakeDirectories(root.Path("/volume1/@database/pgsql"), 0755);
+  kova::MakeDirectories(root.Path("/volume2/share"), 0755);
+  kova::MakeDirectories(root.Path("/var/services"), 0755);
+  ASSERT_EQ(symlink("/volume1/@database/pgsql", root.Path("/var/services/pgsql").c_str()), 0);
+  ASSERT_EQ(symlink("../../volume2/./share", root.Path("/var/services/share").c_str()), 0);
+  ASSERT_EQ(symlink("/volume3/gone", root.Path("/var/services/gone").c_str()), 0);
+  const struct {
+    const char* link;
+    size_t size;
+    int result;
+    std::string volume;
+  } cases[] = {
+      {"pgsql", 4095, 1, root.Path("/volume1")},
+      {"share", 4095, 1, root.Path("/volume2")},
+      {"gone", 4095, 0, ""},
+      {"absent", 4095, 0, ""},
+      {"../services/pgsql", 4095, -1, ""},
+      {"pgsql", 4, -1, ""},
+  };
+  for (const auto& c : cases) {
+    char volume[4095] = "";
+    EXPECT_EQ(KOVAShareServiceVolumeGetbyLink(c.link, volume, c.size), c.result) << c.link;
+    EXPECT_EQ(volume, c.volume) << c.link;
+  }
+}
+
+}  // namespace

@@ -12,6 +12,7 @@
 #include "fake/run_in_child.h"
 #include "kova/conf.h"
 #include "kova/error.h"
+#include "src/system_root.h"
 #include "src/test_root.h"
 
 namespace {

@@ -10,6 +10,7 @@
 #include "kova/service.h"
 #include "src/service_process.h"
 #include "src/services.h"
+#include "src/system_root.h"
 #include "src/test_root.h"
 
 namespace {

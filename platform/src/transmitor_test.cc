@@ -10,6 +10,7 @@
 
 #include "fake/host_call.h"
 #include "kova/error.h"
+#include "src/system_root.h"
 #include "src/test_root.h"
 
 namespace {

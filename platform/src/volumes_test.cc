@@ -3,6 +3,7 @@
 
 #include "kova/error.h"
 #include "kova/service.h"
+#include "src/system_root.h"
 #include "src/test_root.h"
 
 namespace {

@@ -1,0 +1,32 @@
+// Length-prefixed frames on a stream socket: a 4-byte big-endian length, then
+// that many bytes. Every wait is bounded by a deadline.
+
+#ifndef KOVA_HOST_FRAME_H_
+#define KOVA_HOST_FRAME_H_
+
+#include <chrono>
+#include <string>
+#include <string_view>
+
+namespace kova_host {
+
+using Clock = std::chrono::steady_clock;
+// No deadline at all.
+inline constexpr Clock::time_point kNoDeadline = Clock::time_point::max();
+// The largest frame either side accepts: a handler's whole output fits.
+inline constexpr size_t kMaxFrame = size_t{256} << 20;
+
+enum class IoResult {
+  kOk,
+  kClosed,    // the other side closed the socket (or died)
+  kTimeout,   // the deadline passed
+  kTooLarge,  // a frame longer than allowed
+  kError,     // any other failure (errno says which)
+};
+
+IoResult WriteFrame(int fd, std::string_view payload, Clock::time_point deadline);
+IoResult ReadFrame(int fd, std::string& payload, size_t max_size, Clock::time_point deadline);
+
+}  // namespace kova_host
+
+#endif  // KOVA_HOST_FRAME_H_

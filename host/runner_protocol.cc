@@ -1,0 +1,82 @@
+#include "host/runner_protocol.h"
+
+#include "host/json_text.h"
+
+namespace kova_host {
+namespace {
+
+constexpr size_t kMaxMessage = size_t{2} << 20;  // a call carries at most a 1 MiB body
+
+IoResult ReadJson(int fd, Json::Value& value, Clock::time_point deadline) {
+  std::string text;
+  const IoResult got = ReadFrame(fd, text, kMaxMessage, deadline);
+  if (got != IoResult::kOk) return got;
+  return FromJson(text, value) && value.isObject() ? IoResult::kOk : IoResult::kError;
+}
+
+bool IsText(const Json::Value& value) { return value.isString(); }
+
+}  // namespace
+
+IoResult SendReady(int fd, const Json::Value& methods) {
+  Json::Value message;
+  message["kind"] = "ready";
+  message["methods"] = methods;
+  return WriteFrame(fd, ToJson(message), kNoDeadline);
+}
+
+IoResult ReceiveReady(int fd, Json::Value& methods, Clock::time_point deadline) {
+  Json::Value message;
+  const IoResult got = ReadJson(fd, message, deadline);
+  if (got != IoResult::kOk) return got;
+  if (message["kind"] != "ready" || !message["methods"].isArray()) return IoResult::kError;
+  methods = message["methods"];
+  return IoResult::kOk;
+}
+
+IoResult SendCall(int fd, const RunnerCall& call, Clock::time_point deadline) {
+  Json::Value message;
+  message["api"] = call.api;
+  message["version"] = call.version;
+  message["method"] = call.method;
+  message["params"] = call.params;
+  message["user"] = call.user;
+  message["language"] = call.language;
+  return WriteFrame(fd, ToJson(message), deadline);
+}
+
+IoResult ReceiveCall(int fd, RunnerCall& call) {
+  Json::Value message;
+  const IoResult got = ReadJson(fd, message, kNoDeadline);
+  if (got != IoResult::kOk) return got;
+  if (!IsText(message["api"]) || !message["version"].isInt() || !IsText(message["method"]) ||
+      !message["params"].isObject() || !IsText(message["user"]) ||
+      !IsText(message["language"])) {
+    return IoResult::kError;
+  }
+  call = {message["api"].asString(),    message["version"].asInt(),
+          message["method"].asString(), message["params"],
+          message["user"].asString(),   message["language"].asString()};
+  return IoResult::kOk;
+}
+
+IoResult SendAnswer(int fd, const RunnerAnswer& answer) {
+  Json::Value header;
+  header["kind"] = answer.raw ? "raw" : "json";
+  header["code"] = answer.code;
+  const IoResult sent = WriteFrame(fd, ToJson(header), kNoDeadline);
+  return sent == IoResult::kOk ? WriteFrame(fd, answer.body, kNoDeadline) : sent;
+}
+
+IoResult ReceiveAnswer(int fd, RunnerAnswer& answer, Clock::time_point deadline) {
+  Json::Value header;
+  const IoResult got = ReadJson(fd, header, deadline);
+  if (got != IoResult::kOk) return got;
+  const Json::Value& kind = header["kind"];
+  if ((kind != "raw" && kind != "json") || !header["code"].isInt()) return IoResult::kError;
+  answer.raw = kind == "raw";
+  answer.code = header["code"].asInt();
+  return ReadFrame(fd, answer.body, kMaxFrame, deadline);
+}
+
+}  // namespace kova_host

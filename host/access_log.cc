@@ -48,9 +48,9 @@ std::string AccessLine(const std::string& remote, const std::string& http_method
 void LogAccess(const std::string& remote, const std::string& http_method, const std::string& path,
                int status) {
   AccessRecord& record = CurrentAccess();
-  const std::string line = AccessLine(remote, http_method, path, status, record,
-                                      std::chrono::steady_clock::now()) +
-                           "\n";
+  const std::string line =
+      AccessLine(remote, http_method, path, status, record, std::chrono::steady_clock::now()) +
+      "\n";
   [[maybe_unused]] const ssize_t ignored = write(STDERR_FILENO, line.data(), line.size());
   record = AccessRecord();
 }

@@ -64,8 +64,7 @@ IoResult WriteFrame(int fd, std::string_view payload, Clock::time_point deadline
   const uint32_t size = static_cast<uint32_t>(payload.size());
   const char prefix[4] = {static_cast<char>(size >> 24), static_cast<char>(size >> 16),
                           static_cast<char>(size >> 8), static_cast<char>(size)};
-  if (IoResult written = WriteAll(fd, prefix, sizeof(prefix), deadline);
-      written != IoResult::kOk) {
+  if (IoResult written = WriteAll(fd, prefix, sizeof(prefix), deadline); written != IoResult::kOk) {
     return written;
   }
   return WriteAll(fd, payload.data(), payload.size(), deadline);

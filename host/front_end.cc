@@ -65,10 +65,9 @@ int RunFrontEnd(int control, const Options& options, const Identity* account) {
   pthread_sigmask(SIG_BLOCK, &stop_signals, nullptr);
 
   httplib::Server server;
-  const int port = options.port == 0 ? server.bind_to_any_port(options.bind)
-                                     : (server.bind_to_port(options.bind, options.port)
-                                            ? options.port
-                                            : -1);
+  const int port = options.port == 0
+                       ? server.bind_to_any_port(options.bind)
+                       : (server.bind_to_port(options.bind, options.port) ? options.port : -1);
   if (port < 0) {
     HostLog("cannot listen on %s port %d", options.bind.c_str(), options.port);
     return 1;

@@ -30,7 +30,11 @@ bool FromJson(std::string_view text, Json::Value& value) {
   }();
   if (text.empty()) return false;
   std::string errors;
-  return reader->parse(text.data(), text.data() + text.size(), &value, &errors);
+  try {
+    return reader->parse(text.data(), text.data() + text.size(), &value, &errors);
+  } catch (const Json::Exception&) {  // nested deeper than the limit
+    return false;
+  }
 }
 
 Json::Value SuccessEnvelope(const Json::Value& data) {

@@ -80,9 +80,8 @@ std::string CheckTables(const APITableEntry* table, const APICheckEntry* checks)
     if (!methods.insert(key).second) return Describe(key) + " comes twice";
   }
   rows = 0;
-  for (const APICheckEntry* row = checks; row != nullptr && (row->api != nullptr ||
-                                                             row->method != nullptr ||
-                                                             row->check != nullptr);
+  for (const APICheckEntry* row = checks;
+       row != nullptr && (row->api != nullptr || row->method != nullptr || row->check != nullptr);
        ++row) {
     if (++rows > kMaxTableRows) return "its check table has no terminating row";
     const Key key{row->api != nullptr ? row->api : "", row->version,

@@ -75,8 +75,8 @@ int Receive(int socket, Json::Value& message, int* fd = nullptr) {
     }
   }
   text.resize(static_cast<size_t>(got));
-  const bool ok = (header.msg_flags & MSG_TRUNC) == 0 && FromJson(text, message) &&
-                  message.isObject();
+  const bool ok =
+      (header.msg_flags & MSG_TRUNC) == 0 && FromJson(text, message) && message.isObject();
   if (!ok && fd != nullptr && *fd >= 0) {
     close(*fd);
     *fd = -1;
@@ -165,9 +165,13 @@ class Monitor {
 
   void StopRunner() {
     if (runner_ <= 0) return;
-    kill(runner_, SIGKILL);
     int status;
-    while (waitpid(runner_, &status, 0) < 0 && errno == EINTR) {
+    if (waitpid(runner_, &status, WNOHANG) == runner_) {
+      HostLog("runner %d %s", static_cast<int>(runner_), Ended(status).c_str());
+    } else {
+      kill(runner_, SIGKILL);
+      while (waitpid(runner_, &status, 0) < 0 && errno == EINTR) {
+      }
     }
     runner_ = 0;
   }
@@ -215,7 +219,7 @@ class Monitor {
 }  // namespace
 
 int RunMonitor(int control, pid_t front_end, const RunnerSetup& setup) {
-  struct sigaction action{};
+  struct sigaction action {};
   action.sa_handler = OnStopSignal;  // no SA_RESTART: a signal ends the wait
   sigemptyset(&action.sa_mask);
   for (int signal : {SIGTERM, SIGINT, SIGHUP}) sigaction(signal, &action, nullptr);

@@ -11,10 +11,10 @@ namespace kova_host {
 
 struct Options {
   std::string bind = "127.0.0.1";
-  int port = 5000;          // 0: any free port, printed when listening
+  int port = 5000;              // 0: any free port, printed when listening
   std::string user = "nobody";  // the unprivileged account, when started as root
-  std::string modules_dir;  // default: /usr/lib/kova/webapi under the system root
-  std::string static_dir;   // default: /usr/share/kova/www under the system root
+  std::string modules_dir;      // default: /usr/lib/kova/webapi under the system root
+  std::string static_dir;       // default: /usr/share/kova/www under the system root
   std::chrono::seconds idle_timeout{900};
   std::chrono::seconds call_timeout{120};
 };

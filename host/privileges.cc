@@ -64,8 +64,8 @@ bool DropForGood(const Identity& identity, std::string& error) {
   if (setresgid(gid, gid, gid) != 0) return Failed("setresgid", error);
   if (setresuid(uid, uid, uid) != 0) return Failed("setresuid", error);
   const IdSnapshot now = SnapshotIds();
-  if (now.ruid != uid || now.euid != uid || now.suid != uid || now.rgid != gid ||
-      now.egid != gid || now.sgid != gid || now.groups != Sorted(identity.groups)) {
+  if (now.ruid != uid || now.euid != uid || now.suid != uid || now.rgid != gid || now.egid != gid ||
+      now.sgid != gid || now.groups != Sorted(identity.groups)) {
     error = "the ids did not change as asked";
     return false;
   }
@@ -110,8 +110,7 @@ bool RestoreIds(const IdSnapshot& wanted, bool& changed, std::string& error) {
   }
   // Root's user id first: it is what lets the group ids change.
   if (now.euid != 0 && setresuid(-1, 0, -1) != 0) return Failed("setresuid", error);
-  if (now.groups != wanted.groups &&
-      setgroups(wanted.groups.size(), wanted.groups.data()) != 0) {
+  if (now.groups != wanted.groups && setgroups(wanted.groups.size(), wanted.groups.data()) != 0) {
     return Failed("setgroups", error);
   }
   if (setresgid(-1, wanted.egid, -1) != 0) return Failed("setresgid", error);

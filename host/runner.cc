@@ -34,8 +34,8 @@ bool TakeOutput(std::string& output) {
   output.resize(static_cast<size_t>(size));
   size_t done = 0;
   while (done < output.size()) {
-    const ssize_t got = pread(STDOUT_FILENO, output.data() + done, output.size() - done,
-                              static_cast<off_t>(done));
+    const ssize_t got =
+        pread(STDOUT_FILENO, output.data() + done, output.size() - done, static_cast<off_t>(done));
     if (got <= 0) break;
     done += static_cast<size_t>(got);
   }
@@ -105,8 +105,7 @@ int RunRunner(int fd, const RunnerSetup& setup) {
   signal(SIGINT, SIG_IGN);  // the monitor stops the runner
   const int null = open("/dev/null", O_RDONLY | O_CLOEXEC);
   const int output = memfd_create("kova-webapid-output", MFD_CLOEXEC);
-  if (null < 0 || output < 0 || dup2(null, STDIN_FILENO) < 0 ||
-      dup2(output, STDOUT_FILENO) < 0) {
+  if (null < 0 || output < 0 || dup2(null, STDIN_FILENO) < 0 || dup2(output, STDOUT_FILENO) < 0) {
     HostLog("runner: cannot set up standard input and output");
     return 1;
   }

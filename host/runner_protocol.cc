@@ -50,13 +50,11 @@ IoResult ReceiveCall(int fd, RunnerCall& call) {
   const IoResult got = ReadJson(fd, message, kNoDeadline);
   if (got != IoResult::kOk) return got;
   if (!IsText(message["api"]) || !message["version"].isInt() || !IsText(message["method"]) ||
-      !message["params"].isObject() || !IsText(message["user"]) ||
-      !IsText(message["language"])) {
+      !message["params"].isObject() || !IsText(message["user"]) || !IsText(message["language"])) {
     return IoResult::kError;
   }
-  call = {message["api"].asString(),    message["version"].asInt(),
-          message["method"].asString(), message["params"],
-          message["user"].asString(),   message["language"].asString()};
+  call = {message["api"].asString(), message["version"].asInt(), message["method"].asString(),
+          message["params"],         message["user"].asString(), message["language"].asString()};
   return IoResult::kOk;
 }
 

@@ -31,9 +31,8 @@ std::string SessionStore::Create(const std::string& account, bool admin,
   created = {account, admin, RandomHex(32), language, now};
   std::string sid = RandomHex(32);
   std::lock_guard lock(mutex_);
-  std::erase_if(sessions_, [&](const auto& entry) {
-    return now - entry.second.last_used > idle_limit_;
-  });
+  std::erase_if(sessions_,
+                [&](const auto& entry) { return now - entry.second.last_used > idle_limit_; });
   if (sessions_.size() >= capacity_) {
     sessions_.erase(std::min_element(sessions_.begin(), sessions_.end(), [](auto& a, auto& b) {
       return a.second.last_used < b.second.last_used;
@@ -72,8 +71,8 @@ int LoginThrottle::WaitSeconds(const std::vector<std::string>& keys, TimePoint n
     auto it = records_.find(key);
     if (it == records_.end() || it->second.failures < kFreeFailures) continue;
     const int doublings = std::min(it->second.failures - kFreeFailures, 16);
-    const auto delay = std::min<std::chrono::seconds>(std::chrono::seconds(1LL << doublings),
-                                                      kMaxWait);
+    const auto delay =
+        std::min<std::chrono::seconds>(std::chrono::seconds(1LL << doublings), kMaxWait);
     const auto left =
         std::chrono::ceil<std::chrono::seconds>(it->second.last + delay - now).count();
     wait = std::max<long long>(wait, left);
@@ -97,9 +96,8 @@ void LoginThrottle::Succeeded(const std::vector<std::string>& keys) {
 }
 
 void LoginThrottle::Forget(TimePoint now) {
-  std::erase_if(records_, [&](const auto& entry) {
-    return now - entry.second.last > std::chrono::hours(1);
-  });
+  std::erase_if(records_,
+                [&](const auto& entry) { return now - entry.second.last > std::chrono::hours(1); });
   while (records_.size() >= kCapacity) {
     records_.erase(std::min_element(records_.begin(), records_.end(), [](auto& a, auto& b) {
       return a.second.last < b.second.last;

@@ -86,8 +86,8 @@ std::string Language(const std::string* param, const std::string& accept) {
 }
 
 std::string SessionCookie(const std::string& sid) {
-  return std::string(kSessionCookie) + "=" + sid +
-         (sid.empty() ? "; Max-Age=0" : "") + "; Path=/; HttpOnly; SameSite=Strict";
+  return std::string(kSessionCookie) + "=" + sid + (sid.empty() ? "; Max-Age=0" : "") +
+         "; Path=/; HttpOnly; SameSite=Strict";
 }
 
 }  // namespace
@@ -284,7 +284,8 @@ EntryReply WebEntry::RunModule(const EntryRequest& request, const Call& call) {
   if (!FindSession(request, call, sid, session, refused)) return refused;
   if (!session.admin) return Error(KOVA::kAPIErrorNotPermitted, "for administrators only");
 
-  RunnerCall runner_call{call.api, call.version, call.method, Json::Value(Json::objectValue),
+  RunnerCall runner_call{call.api,        call.version,
+                         call.method,     Json::Value(Json::objectValue),
                          session.account, session.language};
   for (const auto& [name, text] : call.fields) {
     if (kHostParams.count(name) == 0) runner_call.params[name] = ParamValue(text);

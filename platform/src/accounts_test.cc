@@ -56,9 +56,16 @@ TEST(AccountsTest, RefusesBadNamesPasswordsAndFiles) {
     std::string name;
     std::string password;
   } refused[] = {
-      {"", "pw"},         {"-admin", "pw"}, {".admin", "pw"},  {"a:b", "pw"},
-      {"a b", "pw"},      {std::string(33, 'a'), "pw"},        {"admin", ""},
-      {"admin", "a\nb"},  {"admin", std::string("a\0b", 3)},   {"admin", std::string(1025, 'x')},
+      {"", "pw"},
+      {"-admin", "pw"},
+      {".admin", "pw"},
+      {"a:b", "pw"},
+      {"a b", "pw"},
+      {std::string(33, 'a'), "pw"},
+      {"admin", ""},
+      {"admin", "a\nb"},
+      {"admin", std::string("a\0b", 3)},
+      {"admin", std::string(1025, 'x')},
   };
   for (const auto& c : refused) {
     EXPECT_EQ(kova::AddAccount(c.name, c.password, true), -1) << c.name;

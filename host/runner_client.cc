@@ -51,6 +51,7 @@ bool RunnerClient::StartLocked(std::string& error) {
     return false;
   }
   fd_ = fd;
+  running_ = true;
   std::lock_guard lock(methods_mutex_);
   methods_ = std::make_shared<const Json::Value>(std::move(methods));
   return true;
@@ -59,6 +60,7 @@ bool RunnerClient::StartLocked(std::string& error) {
 void RunnerClient::StopLocked() {
   if (fd_ >= 0) close(fd_);
   fd_ = -1;
+  running_ = false;
   launcher_.Stop();
 }
 

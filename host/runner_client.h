@@ -6,6 +6,7 @@
 
 #include <json/value.h>
 
+#include <atomic>
 #include <chrono>
 #include <memory>
 #include <mutex>
@@ -37,6 +38,9 @@ class RunnerClient {
   // stopped and a fresh one started, and the result is false with `error`.
   bool Call(const RunnerCall& call, RunnerAnswer& answer, std::string& error);
 
+  // Whether a runner is up (it may still die on the next call).
+  bool Running() const { return running_; }
+
   // The methods the last started runner serves: {"api", "version", "method"}.
   std::shared_ptr<const Json::Value> Methods() const;
 
@@ -48,6 +52,7 @@ class RunnerClient {
   const std::chrono::milliseconds call_timeout_;
   std::mutex call_mutex_;  // one call at a time
   int fd_ = -1;
+  std::atomic<bool> running_{false};
   mutable std::mutex methods_mutex_;
   std::shared_ptr<const Json::Value> methods_;
 };

@@ -139,10 +139,13 @@ TEST_F(ServicesTest, DisplayNames) {
 
 // A process that ignores SIGTERM is killed once the grace time is over.
 TEST(ServiceProcessTest, TerminateKillsWhatIgnoresTerm) {
+  TestRoot root;
+  const std::string ready = root.Path("/ready");
   kova::ProcessIdentity process;
-  ASSERT_TRUE(kova::LaunchDetached({"/bin/sh", "-c", "trap '' TERM; while :; do sleep 0.05; done"},
-                                   {"PATH=/usr/bin:/bin"}, process));
-  ASSERT_TRUE(kova::IsAlive(process));
+  ASSERT_TRUE(kova::LaunchDetached(
+      {"/bin/sh", "-c", "trap '' TERM; : > \"$0\"; while :; do sleep 0.05; done", ready},
+      {"PATH=/usr/bin:/bin"}, process));
+  ASSERT_TRUE(Eventually([&] { return access(ready.c_str(), F_OK) == 0; }));  // TERM ignored now
   const auto start = std::chrono::steady_clock::now();
   EXPECT_TRUE(kova::Terminate(process, milliseconds(300)));
   EXPECT_GE(std::chrono::steady_clock::now() - start, milliseconds(300));

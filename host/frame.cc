@@ -3,6 +3,7 @@
 #include <errno.h>
 #include <poll.h>
 #include <sys/socket.h>
+#include <sys/uio.h>
 
 #include <algorithm>
 #include <cstdint>
@@ -27,20 +28,39 @@ IoResult Wait(int fd, short events, Clock::time_point deadline) {
   }
 }
 
-IoResult WriteAll(int fd, const char* data, size_t size, Clock::time_point deadline) {
-  while (size > 0) {
-    const ssize_t sent = send(fd, data, size, MSG_NOSIGNAL | MSG_DONTWAIT);
-    if (sent > 0) {
-      data += sent;
-      size -= static_cast<size_t>(sent);
+// Sends the buffers of `parts` in order, resuming after partial sends.
+IoResult WriteAll(int fd, iovec* parts, size_t count, Clock::time_point deadline) {
+  while (count > 0) {
+    msghdr message{};
+    message.msg_iov = parts;
+    message.msg_iovlen = count;
+    ssize_t sent = sendmsg(fd, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
+    if (sent < 0) {
+      if (errno == EPIPE || errno == ECONNRESET) return IoResult::kClosed;
+      if (errno != EAGAIN && errno != EINTR) return IoResult::kError;
+      if (IoResult waited = Wait(fd, POLLOUT, deadline); waited != IoResult::kOk) return waited;
       continue;
     }
-    if (errno == EPIPE || errno == ECONNRESET) return IoResult::kClosed;
-    if (errno != EAGAIN && errno != EINTR) return IoResult::kError;
-    if (IoResult waited = Wait(fd, POLLOUT, deadline); waited != IoResult::kOk) return waited;
+    for (; count > 0 && static_cast<size_t>(sent) >= parts->iov_len; ++parts, --count) {
+      sent -= static_cast<ssize_t>(parts->iov_len);
+    }
+    if (count > 0) {
+      parts->iov_base = static_cast<char*>(parts->iov_base) + sent;
+      parts->iov_len -= static_cast<size_t>(sent);
+    }
   }
   return IoResult::kOk;
 }
+
+void Prefix(std::string_view payload, unsigned char (&prefix)[4]) {
+  const uint32_t size = static_cast<uint32_t>(payload.size());
+  prefix[0] = static_cast<unsigned char>(size >> 24);
+  prefix[1] = static_cast<unsigned char>(size >> 16);
+  prefix[2] = static_cast<unsigned char>(size >> 8);
+  prefix[3] = static_cast<unsigned char>(size);
+}
+
+iovec Part(const void* data, size_t size) { return {const_cast<void*>(data), size}; }
 
 IoResult ReadAll(int fd, char* data, size_t size, Clock::time_point deadline) {
   while (size > 0) {
@@ -61,13 +81,21 @@ IoResult ReadAll(int fd, char* data, size_t size, Clock::time_point deadline) {
 
 IoResult WriteFrame(int fd, std::string_view payload, Clock::time_point deadline) {
   if (payload.size() > kMaxFrame) return IoResult::kTooLarge;
-  const uint32_t size = static_cast<uint32_t>(payload.size());
-  const char prefix[4] = {static_cast<char>(size >> 24), static_cast<char>(size >> 16),
-                          static_cast<char>(size >> 8), static_cast<char>(size)};
-  if (IoResult written = WriteAll(fd, prefix, sizeof(prefix), deadline); written != IoResult::kOk) {
-    return written;
-  }
-  return WriteAll(fd, payload.data(), payload.size(), deadline);
+  unsigned char prefix[4];
+  Prefix(payload, prefix);
+  iovec parts[] = {Part(prefix, 4), Part(payload.data(), payload.size())};
+  return WriteAll(fd, parts, 2, deadline);
+}
+
+IoResult WriteFrames(int fd, std::string_view first, std::string_view second,
+                     Clock::time_point deadline) {
+  if (first.size() > kMaxFrame || second.size() > kMaxFrame) return IoResult::kTooLarge;
+  unsigned char prefixes[2][4];
+  Prefix(first, prefixes[0]);
+  Prefix(second, prefixes[1]);
+  iovec parts[] = {Part(prefixes[0], 4), Part(first.data(), first.size()), Part(prefixes[1], 4),
+                   Part(second.data(), second.size())};
+  return WriteAll(fd, parts, 4, deadline);
 }
 
 IoResult ReadFrame(int fd, std::string& payload, size_t max_size, Clock::time_point deadline) {

@@ -25,6 +25,10 @@ enum class IoResult {
 };
 
 IoResult WriteFrame(int fd, std::string_view payload, Clock::time_point deadline);
+// Writes two frames with one system call where the socket takes them whole, so
+// that the reader wakes once.
+IoResult WriteFrames(int fd, std::string_view first, std::string_view second,
+                     Clock::time_point deadline);
 IoResult ReadFrame(int fd, std::string& payload, size_t max_size, Clock::time_point deadline);
 
 }  // namespace kova_host

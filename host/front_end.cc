@@ -65,6 +65,8 @@ int RunFrontEnd(int control, const Options& options, const Identity* account) {
   pthread_sigmask(SIG_BLOCK, &stop_signals, nullptr);
 
   httplib::Server server;
+  // Set before binding: accepted sockets inherit it from the listening one.
+  server.set_tcp_nodelay(true);  // headers and body go out as written, not 40 ms later
   const int port = options.port == 0
                        ? server.bind_to_any_port(options.bind)
                        : (server.bind_to_port(options.bind, options.port) ? options.port : -1);

@@ -19,6 +19,7 @@ namespace {
 
 void ResetOutput() {
   fflush(stdout);
+  if (lseek(STDOUT_FILENO, 0, SEEK_END) == 0) return;  // nothing written since the last reset
   if (ftruncate(STDOUT_FILENO, 0) != 0 || lseek(STDOUT_FILENO, 0, SEEK_SET) != 0) {
     HostLog("runner: cannot reset the captured output");
   }

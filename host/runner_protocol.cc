@@ -62,8 +62,7 @@ IoResult SendAnswer(int fd, const RunnerAnswer& answer) {
   Json::Value header;
   header["kind"] = answer.raw ? "raw" : "json";
   header["code"] = answer.code;
-  const IoResult sent = WriteFrame(fd, ToJson(header), kNoDeadline);
-  return sent == IoResult::kOk ? WriteFrame(fd, answer.body, kNoDeadline) : sent;
+  return WriteFrames(fd, ToJson(header), answer.body, kNoDeadline);
 }
 
 IoResult ReceiveAnswer(int fd, RunnerAnswer& answer, Clock::time_point deadline) {

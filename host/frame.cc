@@ -62,21 +62,6 @@ void Prefix(std::string_view payload, unsigned char (&prefix)[4]) {
 
 iovec Part(const void* data, size_t size) { return {const_cast<void*>(data), size}; }
 
-IoResult ReadAll(int fd, char* data, size_t size, Clock::time_point deadline) {
-  while (size > 0) {
-    const ssize_t got = recv(fd, data, size, MSG_DONTWAIT);
-    if (got > 0) {
-      data += got;
-      size -= static_cast<size_t>(got);
-      continue;
-    }
-    if (got == 0 || errno == ECONNRESET) return IoResult::kClosed;
-    if (errno != EAGAIN && errno != EINTR) return IoResult::kError;
-    if (IoResult waited = Wait(fd, POLLIN, deadline); waited != IoResult::kOk) return waited;
-  }
-  return IoResult::kOk;
-}
-
 }  // namespace
 
 IoResult WriteFrame(int fd, std::string_view payload, Clock::time_point deadline) {
@@ -98,17 +83,42 @@ IoResult WriteFrames(int fd, std::string_view first, std::string_view second,
   return WriteAll(fd, parts, 4, deadline);
 }
 
-IoResult ReadFrame(int fd, std::string& payload, size_t max_size, Clock::time_point deadline) {
-  unsigned char prefix[4];
-  if (IoResult got = ReadAll(fd, reinterpret_cast<char*>(prefix), sizeof(prefix), deadline);
-      got != IoResult::kOk) {
-    return got;
+IoResult FrameReader::Fill(size_t size, Clock::time_point deadline) {
+  if (start_ > 0 && buffer_.size() - start_ < size) {
+    buffer_.erase(0, start_);
+    start_ = 0;
   }
+  while (buffer_.size() - start_ < size) {
+    // Without a deadline the read may block; with one, poll says when to read.
+    if (deadline != kNoDeadline) {
+      if (IoResult waited = Wait(fd_, POLLIN, deadline); waited != IoResult::kOk) return waited;
+    }
+    const size_t have = buffer_.size();
+    buffer_.resize(std::max(start_ + size, have + 65536));
+    const ssize_t got = recv(fd_, buffer_.data() + have, buffer_.size() - have,
+                             deadline == kNoDeadline ? 0 : MSG_DONTWAIT);
+    buffer_.resize(have + (got > 0 ? static_cast<size_t>(got) : 0));
+    if (got > 0) continue;
+    if (got == 0 || errno == ECONNRESET) return IoResult::kClosed;
+    if (errno != EAGAIN && errno != EINTR) return IoResult::kError;
+  }
+  return IoResult::kOk;
+}
+
+IoResult FrameReader::Read(std::string& payload, size_t max_size, Clock::time_point deadline) {
+  if (IoResult got = Fill(4, deadline); got != IoResult::kOk) return got;
+  const auto* prefix = reinterpret_cast<const unsigned char*>(buffer_.data() + start_);
   const size_t size = (size_t{prefix[0]} << 24) | (size_t{prefix[1]} << 16) |
                       (size_t{prefix[2]} << 8) | size_t{prefix[3]};
   if (size > max_size) return IoResult::kTooLarge;
-  payload.resize(size);
-  return ReadAll(fd, payload.data(), size, deadline);
+  if (IoResult got = Fill(4 + size, deadline); got != IoResult::kOk) return got;
+  payload.assign(buffer_, start_ + 4, size);
+  start_ += 4 + size;
+  if (start_ == buffer_.size()) {
+    buffer_.clear();
+    start_ = 0;
+  }
+  return IoResult::kOk;
 }
 
 }  // namespace kova_host

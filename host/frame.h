@@ -29,7 +29,21 @@ IoResult WriteFrame(int fd, std::string_view payload, Clock::time_point deadline
 // that the reader wakes once.
 IoResult WriteFrames(int fd, std::string_view first, std::string_view second,
                      Clock::time_point deadline);
-IoResult ReadFrame(int fd, std::string& payload, size_t max_size, Clock::time_point deadline);
+// Reads frames from one socket, taking whatever the socket holds at once, so
+// that a message of several frames costs one read where it can.
+class FrameReader {
+ public:
+  explicit FrameReader(int fd) : fd_(fd) {}
+  IoResult Read(std::string& payload, size_t max_size, Clock::time_point deadline);
+
+ private:
+  // Reads until `size` unread bytes are buffered.
+  IoResult Fill(size_t size, Clock::time_point deadline);
+
+  int fd_;
+  std::string buffer_;
+  size_t start_ = 0;  // the first unread byte of buffer_
+};
 
 }  // namespace kova_host
 

@@ -17,9 +17,12 @@
 namespace kova_host {
 namespace {
 
+// How much the last call wrote, -1 before the first.
+off_t last_output = -1;
+
 void ResetOutput() {
   fflush(stdout);
-  if (lseek(STDOUT_FILENO, 0, SEEK_END) == 0) return;  // nothing written since the last reset
+  if (last_output == 0) return;  // the file is empty still
   if (ftruncate(STDOUT_FILENO, 0) != 0 || lseek(STDOUT_FILENO, 0, SEEK_SET) != 0) {
     HostLog("runner: cannot reset the captured output");
   }
@@ -29,6 +32,7 @@ void ResetOutput() {
 bool TakeOutput(std::string& output) {
   fflush(stdout);
   const off_t size = lseek(STDOUT_FILENO, 0, SEEK_END);
+  last_output = size;
   output.clear();
   if (size <= 0) return true;
   if (static_cast<size_t>(size) > kMaxFrame) return false;
@@ -122,9 +126,10 @@ int RunRunner(int fd, const RunnerSetup& setup) {
   const IdSnapshot ids = SnapshotIds();
   LoadModules(setup.modules_dir);
   if (SendReady(fd, KOVA::APIRunner::List()) != IoResult::kOk) return 1;
+  FrameReader reader(fd);
   for (;;) {
     RunnerCall call;
-    const IoResult got = ReceiveCall(fd, call);
+    const IoResult got = ReceiveCall(reader, call);
     if (got == IoResult::kClosed) return 0;
     if (got != IoResult::kOk) {
       HostLog("runner: malformed call from the front-end");

@@ -42,7 +42,8 @@ bool RunnerClient::StartLocked(std::string& error) {
   const int fd = launcher_.Start(error);
   if (fd < 0) return false;
   Json::Value methods;
-  const IoResult ready = ReceiveReady(fd, methods, Clock::now() + kStartTimeout);
+  auto reader = std::make_unique<FrameReader>(fd);
+  const IoResult ready = ReceiveReady(*reader, methods, Clock::now() + kStartTimeout);
   if (ready != IoResult::kOk) {
     error = ready == IoResult::kClosed ? "the runner ended while loading the modules"
                                        : "the runner did not get ready";
@@ -51,6 +52,7 @@ bool RunnerClient::StartLocked(std::string& error) {
     return false;
   }
   fd_ = fd;
+  reader_ = std::move(reader);
   running_ = true;
   std::lock_guard lock(methods_mutex_);
   methods_ = std::make_shared<const Json::Value>(std::move(methods));
@@ -69,7 +71,7 @@ bool RunnerClient::Call(const RunnerCall& call, RunnerAnswer& answer, std::strin
   if (fd_ < 0 && !StartLocked(error)) return false;
   const Clock::time_point deadline = Clock::now() + call_timeout_;
   IoResult result = SendCall(fd_, call, deadline);
-  if (result == IoResult::kOk) result = ReceiveAnswer(fd_, answer, deadline);
+  if (result == IoResult::kOk) result = ReceiveAnswer(*reader_, answer, deadline);
   if (result == IoResult::kOk) return true;
   error = Why(result);
   HostLog("%s v%d %s: %s; starting a fresh runner", call.api.c_str(), call.version,

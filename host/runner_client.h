@@ -52,6 +52,7 @@ class RunnerClient {
   const std::chrono::milliseconds call_timeout_;
   std::mutex call_mutex_;  // one call at a time
   int fd_ = -1;
+  std::unique_ptr<FrameReader> reader_;
   std::atomic<bool> running_{false};
   mutable std::mutex methods_mutex_;
   std::shared_ptr<const Json::Value> methods_;

@@ -7,9 +7,9 @@ namespace {
 
 constexpr size_t kMaxMessage = size_t{2} << 20;  // a call carries at most a 1 MiB body
 
-IoResult ReadJson(int fd, Json::Value& value, Clock::time_point deadline) {
+IoResult ReadJson(FrameReader& reader, Json::Value& value, Clock::time_point deadline) {
   std::string text;
-  const IoResult got = ReadFrame(fd, text, kMaxMessage, deadline);
+  const IoResult got = reader.Read(text, kMaxMessage, deadline);
   if (got != IoResult::kOk) return got;
   return FromJson(text, value) && value.isObject() ? IoResult::kOk : IoResult::kError;
 }
@@ -25,9 +25,9 @@ IoResult SendReady(int fd, const Json::Value& methods) {
   return WriteFrame(fd, ToJson(message), kNoDeadline);
 }
 
-IoResult ReceiveReady(int fd, Json::Value& methods, Clock::time_point deadline) {
+IoResult ReceiveReady(FrameReader& reader, Json::Value& methods, Clock::time_point deadline) {
   Json::Value message;
-  const IoResult got = ReadJson(fd, message, deadline);
+  const IoResult got = ReadJson(reader, message, deadline);
   if (got != IoResult::kOk) return got;
   if (message["kind"] != "ready" || !message["methods"].isArray()) return IoResult::kError;
   methods = message["methods"];
@@ -45,9 +45,9 @@ IoResult SendCall(int fd, const RunnerCall& call, Clock::time_point deadline) {
   return WriteFrame(fd, ToJson(message), deadline);
 }
 
-IoResult ReceiveCall(int fd, RunnerCall& call) {
+IoResult ReceiveCall(FrameReader& reader, RunnerCall& call) {
   Json::Value message;
-  const IoResult got = ReadJson(fd, message, kNoDeadline);
+  const IoResult got = ReadJson(reader, message, kNoDeadline);
   if (got != IoResult::kOk) return got;
   if (!IsText(message["api"]) || !message["version"].isInt() || !IsText(message["method"]) ||
       !message["params"].isObject() || !IsText(message["user"]) || !IsText(message["language"])) {
@@ -65,15 +65,15 @@ IoResult SendAnswer(int fd, const RunnerAnswer& answer) {
   return WriteFrames(fd, ToJson(header), answer.body, kNoDeadline);
 }
 
-IoResult ReceiveAnswer(int fd, RunnerAnswer& answer, Clock::time_point deadline) {
+IoResult ReceiveAnswer(FrameReader& reader, RunnerAnswer& answer, Clock::time_point deadline) {
   Json::Value header;
-  const IoResult got = ReadJson(fd, header, deadline);
+  const IoResult got = ReadJson(reader, header, deadline);
   if (got != IoResult::kOk) return got;
   const Json::Value& kind = header["kind"];
   if ((kind != "raw" && kind != "json") || !header["code"].isInt()) return IoResult::kError;
   answer.raw = kind == "raw";
   answer.code = header["code"].asInt();
-  return ReadFrame(fd, answer.body, kMaxFrame, deadline);
+  return reader.Read(answer.body, kMaxFrame, deadline);
 }
 
 }  // namespace kova_host

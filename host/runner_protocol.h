@@ -33,14 +33,14 @@ struct RunnerAnswer {
 };
 
 IoResult SendReady(int fd, const Json::Value& methods);
-IoResult ReceiveReady(int fd, Json::Value& methods, Clock::time_point deadline);
+IoResult ReceiveReady(FrameReader& reader, Json::Value& methods, Clock::time_point deadline);
 
 IoResult SendCall(int fd, const RunnerCall& call, Clock::time_point deadline);
 // kError also for a frame that isn't a well-formed call.
-IoResult ReceiveCall(int fd, RunnerCall& call);
+IoResult ReceiveCall(FrameReader& reader, RunnerCall& call);
 
 IoResult SendAnswer(int fd, const RunnerAnswer& answer);
-IoResult ReceiveAnswer(int fd, RunnerAnswer& answer, Clock::time_point deadline);
+IoResult ReceiveAnswer(FrameReader& reader, RunnerAnswer& answer, Clock::time_point deadline);
 
 }  // namespace kova_host
 

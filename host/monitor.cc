@@ -165,14 +165,12 @@ class Monitor {
 
   void StopRunner() {
     if (runner_ <= 0) return;
+    // A runner that is ending already keeps the status it ends with.
+    kill(runner_, SIGKILL);
     int status;
-    if (waitpid(runner_, &status, WNOHANG) == runner_) {
-      HostLog("runner %d %s", static_cast<int>(runner_), Ended(status).c_str());
-    } else {
-      kill(runner_, SIGKILL);
-      while (waitpid(runner_, &status, 0) < 0 && errno == EINTR) {
-      }
+    while (waitpid(runner_, &status, 0) < 0 && errno == EINTR) {
     }
+    HostLog("runner %d %s", static_cast<int>(runner_), Ended(status).c_str());
     runner_ = 0;
   }
 

@@ -35,6 +35,10 @@ IoResult ReceiveReady(FrameReader& reader, Json::Value& methods, Clock::time_poi
 }
 
 IoResult SendCall(int fd, const RunnerCall& call, Clock::time_point deadline) {
+  return WriteFrame(fd, EncodeCall(call), deadline);
+}
+
+std::string EncodeCall(const RunnerCall& call) {
   Json::Value message;
   message["api"] = call.api;
   message["version"] = call.version;
@@ -42,7 +46,7 @@ IoResult SendCall(int fd, const RunnerCall& call, Clock::time_point deadline) {
   message["params"] = call.params;
   message["user"] = call.user;
   message["language"] = call.language;
-  return WriteFrame(fd, ToJson(message), deadline);
+  return ToJson(message);
 }
 
 IoResult ReceiveCall(FrameReader& reader, RunnerCall& call) {

@@ -35,6 +35,8 @@ struct RunnerAnswer {
 IoResult SendReady(int fd, const Json::Value& methods);
 IoResult ReceiveReady(FrameReader& reader, Json::Value& methods, Clock::time_point deadline);
 
+// The frame's payload of a call, as SendCall writes it.
+std::string EncodeCall(const RunnerCall& call);
 IoResult SendCall(int fd, const RunnerCall& call, Clock::time_point deadline);
 // kError also for a frame that isn't a well-formed call.
 IoResult ReceiveCall(FrameReader& reader, RunnerCall& call);

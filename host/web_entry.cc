@@ -266,13 +266,10 @@ bool WebEntry::FindSession(const EntryRequest& request, const Call& call, std::s
 }
 
 EntryReply WebEntry::RunModule(const EntryRequest& request, const Call& call) {
-  std::string error;
-  // No runner since the last failed start: try again, for its methods.
-  if (!runner_.Running() && !runner_.Start(error)) {
-    HostLog("cannot start a runner: %s", error.c_str());
-  }
-  bool api_known = false, version_known = false, method_known = false;
-  for (const Json::Value& row : *runner_.Methods()) {
+  const std::shared_ptr<const Json::Value> methods = runner_.Methods();
+  // Before any runner started, the runner itself tells of missing methods.
+  bool api_known = methods->empty(), version_known = api_known, method_known = api_known;
+  for (const Json::Value& row : *methods) {
     if (row["api"].asString() != call.api) continue;
     api_known = true;
     if (row["version"].asInt() != call.version) continue;
@@ -296,6 +293,7 @@ EntryReply WebEntry::RunModule(const EntryRequest& request, const Call& call) {
     if (kHostParams.count(name) == 0) runner_call.params[name] = ParamValue(text);
   }
   RunnerAnswer answer;
+  std::string error;
   if (!runner_.Call(runner_call, answer, error)) {
     return Error(KOVA::kAPIErrorUnknown, error + "; the call was abandoned");
   }

@@ -194,6 +194,7 @@ class Monitor {
   }
 
   void Shutdown() {
+    shutdown(control_, SHUT_RDWR);  // requests of the front-end fail now instead of waiting
     StopRunner();
     if (!front_end_ended_) {
       kill(front_end_, SIGTERM);

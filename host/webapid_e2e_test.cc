@@ -77,7 +77,7 @@ class Host {
       std::this_thread::sleep_for(std::chrono::milliseconds(50));
     }
     if (waitpid(pid_, &status, WNOHANG) == 0) {
-      ADD_FAILURE() << "kova-webapid did not stop on SIGTERM";
+      ADD_FAILURE() << "kova-webapid did not stop on SIGTERM:\n" << Log();
       kill(pid_, SIGKILL);
       waitpid(pid_, &status, 0);
     }
@@ -341,8 +341,18 @@ TEST_F(WebApidTest, AModuleThatCrashesOrHangsDoesNotTakeTheHostDown) {
   const Json::Value first = pid();
   ASSERT_TRUE(first.isInt());
 
-  EXPECT_EQ(Code(Call("KOVA.Test.Crash", "abort", {}, sid)), 100);
-  EXPECT_TRUE(Call(kSetting, "get", {}, sid).json["success"].asBool());
+  // Calls that wait behind the one that crashes are answered by a fresh runner.
+  std::thread crash([&] {
+    EXPECT_EQ(Code(Call("KOVA.Test.Crash", "abort", {{"delay_ms", "300"}}, sid)), 100);
+  });
+  std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  std::vector<std::thread> waiting;
+  for (int i = 0; i < 3; ++i) {
+    waiting.emplace_back(
+        [&] { EXPECT_TRUE(Call(kSetting, "get", {}, sid).json["success"].asBool()); });
+  }
+  crash.join();
+  for (std::thread& thread : waiting) thread.join();
   const Json::Value second = pid();
   EXPECT_NE(second, first);  // a fresh runner
 

@@ -11,7 +11,10 @@
 
 namespace {
 
-void Abort(KOVA::APIRequest*, KOVA::APIResponse*) { abort(); }
+void Abort(KOVA::APIRequest* request, KOVA::APIResponse*) {
+  usleep(request->GetParam("delay_ms", 0).asUInt() * 1000);
+  abort();
+}
 
 void Sleep(KOVA::APIRequest* request, KOVA::APIResponse* response) {
   sleep(request->GetParam("seconds", 5).asUInt());

@@ -73,8 +73,8 @@ bool SameText(const std::string& a, const std::string& b) {
   return differ == 0;
 }
 
-// The interface language: a valid "lang" parameter, else the first language
-// of Accept-Language that the texts have, else English.
+// The interface language: a "lang" parameter of three letters ("enu", "ger"),
+// else German when Accept-Language puts it first, else English.
 std::string Language(const std::string* param, const std::string& accept) {
   if (param != nullptr && param->size() == 3 &&
       param->find_first_not_of("abcdefghijklmnopqrstuvwxyz") == std::string::npos) {

@@ -381,6 +381,13 @@ TEST_F(WebApidTest, AModuleThatCrashesOrHangsDoesNotTakeTheHostDown) {
   EXPECT_EQ(echo.json["data"]["value"], ParseJson(R"({"a": [1, "b"]})"));
   EXPECT_EQ(echo.json["data"]["user"], "admin");
   EXPECT_EQ(echo.json["data"]["has_sid"], false);
+  EXPECT_EQ(echo.json["data"]["language"], "enu");
+  const Reply german =
+      Call("KOVA.API.Auth", "login", {{"account", "admin"}, {"password", kAdminPassword}}, "",
+           {{"Accept-Language", "de-DE,de;q=0.9,en;q=0.5"}});
+  EXPECT_EQ(Call("KOVA.Test.Crash", "echo", {}, german.json["data"]["sid"].asString())
+                .json["data"]["language"],
+            "ger");
   EXPECT_EQ(Call("KOVA.Test.Crash", "echo", {{"value", "csv"}}, sid).json["data"]["value"], "csv");
   EXPECT_THAT(host_->Log(), HasSubstr("killed by signal 6"));
 }

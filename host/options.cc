@@ -1,7 +1,9 @@
 #include "host/options.h"
 
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
+#include <iterator>
 
 namespace kova_host {
 
@@ -32,6 +34,12 @@ int ParseOptions(const std::vector<std::string>& args, Options& options) {
       fputs(kUsage, stdout);
       return -1;
     }
+    static const char* const kNames[] = {"--bind",   "--port",         "--user",        "--modules",
+                                         "--static", "--idle-timeout", "--call-timeout"};
+    if (std::find(std::begin(kNames), std::end(kNames), name) == std::end(kNames)) {
+      fprintf(stderr, "kova-webapid: unknown option %s\n%s", name.c_str(), kUsage);
+      return 2;
+    }
     if (i + 1 == args.size()) {
       fprintf(stderr, "kova-webapid: %s without a value\n%s", name.c_str(), kUsage);
       return 2;
@@ -56,9 +64,6 @@ int ParseOptions(const std::vector<std::string>& args, Options& options) {
     } else if (name == "--call-timeout") {
       ok = ParseNumber(value, 1, 24 * 3600, number);
       options.call_timeout = std::chrono::seconds(number);
-    } else {
-      fprintf(stderr, "kova-webapid: unknown option %s\n%s", name.c_str(), kUsage);
-      return 2;
     }
     if (!ok || value.empty()) {
       fprintf(stderr, "kova-webapid: bad value for %s: %s\n", name.c_str(), value.c_str());

@@ -70,27 +70,49 @@ Json::Value Answer(const APIResponse& response) {
 
 }  // namespace
 
-int APIRunner::Exec(Json::Value& out, const char* api, int version, const char* method,
-                    const Json::Value& params, const char* user) {
+int APIRunner::Call(const char* api, int version, const char* method, APIRequest& request,
+                    APIResponse& response) {
   Method found;
   const int missing = Find({api ? api : "", version, method ? method : ""}, found);
-  if (missing != 0) {
-    out = Failure(missing, Json::Value());
-    return -1;
-  }
+  if (missing != 0) return missing;
+  if (found.check != nullptr && found.check(&request) == 0) return kAPIErrorNotPermitted;
+  found.handler(&request, &response);
+  return 0;
+}
+
+int APIRunner::Exec(Json::Value& out, const char* api, int version, const char* method,
+                    const Json::Value& params, const char* user) {
   APIRequest request(params, user ? user : "", "enu");
   APIResponse response;
   try {
-    if (found.check != nullptr && found.check(&request) == 0) {
-      out = Failure(kAPIErrorNotPermitted, Json::Value());
+    const int refused = Call(api, version, method, request, response);
+    if (refused == kAPIErrorNotPermitted) {
+      out = Failure(refused, Json::Value());
       return 0;
     }
-    found.handler(&request, &response);
+    if (refused != 0) {
+      out = Failure(refused, Json::Value());
+      return -1;
+    }
     out = Answer(response);
   } catch (...) {
     out = Failure(kAPIErrorUnknown, Json::Value());
   }
   return 0;
+}
+
+Json::Value APIRunner::List() {
+  Registry& registry = TheRegistry();
+  std::lock_guard lock(registry.mutex);
+  Json::Value list(Json::arrayValue);
+  for (const auto& [key, unused] : registry.methods) {
+    Json::Value row;
+    row["api"] = std::get<0>(key);
+    row["version"] = std::get<1>(key);
+    row["method"] = std::get<2>(key);
+    list.append(row);
+  }
+  return list;
 }
 
 int APIRunner::Register(const APITableEntry* table, const APICheckEntry* checks) {

@@ -84,4 +84,25 @@ TEST_F(APIRunnerTest, RefusesTablesThatRepeatAMethodOrLackAHandler) {
   }
 }
 
+TEST_F(APIRunnerTest, CallsOnTheCallersRequestAndResponseAndListsTheMethods) {
+  KOVA::APIRequest request(ParseJson(R"({"n": 3})"), "operator", "ger");
+  KOVA::APIResponse response;
+  EXPECT_EQ(KOVA::APIRunner::Call("Test.Echo", 2, "echo", request, response), 0);
+  EXPECT_EQ(response.GetData(), ParseJson(R"({"user": "operator", "n": 3})"));
+
+  KOVA::APIResponse refused;
+  EXPECT_EQ(KOVA::APIRunner::Call("Test.Echo", 1, "denied", request, refused),
+            KOVA::kAPIErrorNotPermitted);
+  EXPECT_EQ(refused.GetSettleCount(), 0);  // the handler did not run
+  EXPECT_EQ(KOVA::APIRunner::Call("Test.Echo", 9, "echo", request, refused),
+            KOVA::kAPIErrorBadVersion);
+  EXPECT_THROW(KOVA::APIRunner::Call("Test.Echo", 1, "throw", request, refused),
+               std::runtime_error);
+
+  const Json::Value list = KOVA::APIRunner::List();
+  ASSERT_EQ(list.size(), 7u);
+  EXPECT_EQ(list[0], ParseJson(R"({"api": "Test.Echo", "version": 1, "method": "denied"})"));
+  EXPECT_EQ(list[6], ParseJson(R"({"api": "Test.Echo", "version": 2, "method": "echo"})"));
+}
+
 }  // namespace

@@ -22,6 +22,7 @@
 #include "src/lun_registry.h"
 #include "src/services.h"
 #include "src/system_root.h"
+#include "tools/kova_user.h"
 
 namespace {
 
@@ -261,7 +262,7 @@ int Lun(Args args) {
 }
 
 constexpr char kHelp[] =
-    "usage: kova conf|service|log|lun ... (each with --help)\n"
+    "usage: kova conf|service|log|lun|user ... (each with --help)\n"
     "Works on the system under $KOVA_ROOT (\"/\" when unset).\n";
 
 }  // namespace
@@ -275,6 +276,7 @@ int main(int argc, char** argv) {
   if (group == "service") return Service(args);
   if (group == "log") return Log(args);
   if (group == "lun") return Lun(args);
+  if (group == "user") return UserCommand(args);
   fprintf(stderr, "kova: unknown command %s\n", group.c_str());
   return Usage(kHelp, false);
 }

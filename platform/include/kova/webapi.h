@@ -127,6 +127,18 @@ class KOVA_API APIRunner {
   static int Exec(Json::Value& out, const char* api, int version, const char* method,
                   const Json::Value& params, const char* user);
 
+  // Runs the registered method (api, version, method) on `request` and
+  // `response`: its check first, when it has one, then its handler. Returns 0
+  // when the handler ran, kAPIErrorNotPermitted when the check refused the call,
+  // or 102, 103 or 104 when no such method is registered. Exceptions of the
+  // check or the handler pass through.
+  static int Call(const char* api, int version, const char* method, APIRequest& request,
+                  APIResponse& response);
+
+  // Every registered method as {"api", "version", "method"}, ordered by api,
+  // version and method.
+  static Json::Value List();
+
   // Registers every row of `table` up to its terminator, and the rows of `checks`
   // (may be null) for the methods of `table`. Returns the number of methods added.
   // Returns -1 and adds nothing when a row has no handler or names a method that

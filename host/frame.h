@@ -1,0 +1,50 @@
+// Length-prefixed frames on a stream socket: a 4-byte big-endian length, then
+// that many bytes. Every wait is bounded by a deadline.
+
+#ifndef KOVA_HOST_FRAME_H_
+#define KOVA_HOST_FRAME_H_
+
+#include <chrono>
+#include <string>
+#include <string_view>
+
+namespace kova_host {
+
+using Clock = std::chrono::steady_clock;
+// No deadline at all.
+inline constexpr Clock::time_point kNoDeadline = Clock::time_point::max();
+// The largest frame either side accepts: a handler's whole output fits.
+inline constexpr size_t kMaxFrame = size_t{256} << 20;
+
+enum class IoResult {
+  kOk,
+  kClosed,    // the other side closed the socket (or died)
+  kTimeout,   // the deadline passed
+  kTooLarge,  // a frame longer than allowed
+  kError,     // any other failure (errno says which)
+};
+
+IoResult WriteFrame(int fd, std::string_view payload, Clock::time_point deadline);
+// Writes two frames with one system call where the socket takes them whole, so
+// that the reader wakes once.
+IoResult WriteFrames(int fd, std::string_view first, std::string_view second,
+                     Clock::time_point deadline);
+// Reads frames from one socket, taking whatever the socket holds at once, so
+// that a message of several frames costs one read where it can.
+class FrameReader {
+ public:
+  explicit FrameReader(int fd) : fd_(fd) {}
+  IoResult Read(std::string& payload, size_t max_size, Clock::time_point deadline);
+
+ private:
+  // Reads until `size` unread bytes are buffered.
+  IoResult Fill(size_t size, Clock::time_point deadline);
+
+  int fd_;
+  std::string buffer_;
+  size_t start_ = 0;  // the first unread byte of buffer_
+};
+
+}  // namespace kova_host
+
+#endif  // KOVA_HOST_FRAME_H_

@@ -1,0 +1,61 @@
+#include "host/json_text.h"
+
+#include <json/reader.h>
+#include <json/writer.h>
+
+#include <memory>
+#include <sstream>
+
+namespace kova_host {
+
+std::string ToJson(const Json::Value& value) {
+  thread_local const std::unique_ptr<Json::StreamWriter> writer = [] {
+    Json::StreamWriterBuilder builder;
+    builder["indentation"] = "";
+    builder["emitUTF8"] = true;
+    return std::unique_ptr<Json::StreamWriter>(builder.newStreamWriter());
+  }();
+  std::ostringstream out;
+  writer->write(value, &out);
+  return out.str();
+}
+
+bool FromJson(std::string_view text, Json::Value& value) {
+  thread_local const std::unique_ptr<Json::CharReader> reader = [] {
+    Json::CharReaderBuilder builder;
+    Json::CharReaderBuilder::strictMode(&builder.settings_);
+    builder["strictRoot"] = false;
+    builder["stackLimit"] = 64;
+    return std::unique_ptr<Json::CharReader>(builder.newCharReader());
+  }();
+  if (text.empty()) return false;
+  std::string errors;
+  try {
+    return reader->parse(text.data(), text.data() + text.size(), &value, &errors);
+  } catch (const Json::Exception&) {  // nested deeper than the limit
+    return false;
+  }
+}
+
+Json::Value SuccessEnvelope(const Json::Value& data) {
+  Json::Value out;
+  out["success"] = true;
+  if (!data.isNull()) out["data"] = data;
+  return out;
+}
+
+Json::Value ErrorEnvelope(int code, const Json::Value& errors) {
+  Json::Value out;
+  out["success"] = false;
+  out["error"]["code"] = code;
+  if (!errors.isNull()) out["error"]["errors"] = errors;
+  return out;
+}
+
+Json::Value ErrorReason(int code, const std::string& reason) {
+  Json::Value errors;
+  errors["reason"] = reason;
+  return ErrorEnvelope(code, errors);
+}
+
+}  // namespace kova_host

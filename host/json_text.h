@@ -1,0 +1,29 @@
+// JSON text in and out, and the envelope every web-API answer travels in.
+
+#ifndef KOVA_HOST_JSON_TEXT_H_
+#define KOVA_HOST_JSON_TEXT_H_
+
+#include <json/value.h>
+
+#include <string>
+#include <string_view>
+
+namespace kova_host {
+
+// `value` as compact JSON text, UTF-8 left as it is.
+std::string ToJson(const Json::Value& value);
+
+// Parses `text` as one JSON value of any type (a number or a string too), the
+// whole text and nothing after it, nested at most 64 deep. False when it isn't.
+bool FromJson(std::string_view text, Json::Value& value);
+
+// {"success": true, "data": DATA}, "data" left out when null.
+Json::Value SuccessEnvelope(const Json::Value& data);
+// {"success": false, "error": {"code": CODE, "errors": ERRORS}}, "errors" left out when null.
+Json::Value ErrorEnvelope(int code, const Json::Value& errors);
+// An error envelope whose "errors" is {"reason": reason}.
+Json::Value ErrorReason(int code, const std::string& reason);
+
+}  // namespace kova_host
+
+#endif  // KOVA_HOST_JSON_TEXT_H_

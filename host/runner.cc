@@ -1,0 +1,150 @@
+#include "host/runner.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/mman.h>
+#include <sys/prctl.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <exception>
+
+#include "host/host_log.h"
+#include "host/json_text.h"
+#include "host/module_loader.h"
+#include "kova/webapi.h"
+
+namespace kova_host {
+namespace {
+
+// How much the last call wrote, -1 before the first.
+off_t last_output = -1;
+
+void ResetOutput() {
+  fflush(stdout);
+  if (last_output == 0) return;  // the file is empty still
+  if (ftruncate(STDOUT_FILENO, 0) != 0 || lseek(STDOUT_FILENO, 0, SEEK_SET) != 0) {
+    HostLog("runner: cannot reset the captured output");
+  }
+}
+
+// What the call wrote to standard output. False when it is too large to hand over.
+bool TakeOutput(std::string& output) {
+  fflush(stdout);
+  const off_t size = lseek(STDOUT_FILENO, 0, SEEK_END);
+  last_output = size;
+  output.clear();
+  if (size <= 0) return true;
+  if (static_cast<size_t>(size) > kMaxFrame) return false;
+  output.resize(static_cast<size_t>(size));
+  size_t done = 0;
+  while (done < output.size()) {
+    const ssize_t got =
+        pread(STDOUT_FILENO, output.data() + done, output.size() - done, static_cast<off_t>(done));
+    if (got <= 0) break;
+    done += static_cast<size_t>(got);
+  }
+  output.resize(done);
+  return true;
+}
+
+std::string Name(const RunnerCall& call) {
+  return call.api + " v" + std::to_string(call.version) + " " + call.method;
+}
+
+Json::Value Reason(const char* text) {
+  Json::Value errors;
+  errors["reason"] = text;
+  return errors;
+}
+
+RunnerAnswer Error(int code, const Json::Value& errors) {
+  return {false, code, ToJson(ErrorEnvelope(code, errors))};
+}
+
+}  // namespace
+
+RunnerAnswer ExecuteCall(const RunnerCall& call) {
+  KOVA::APIRequest request(call.params, call.user, call.language);
+  KOVA::APIResponse response;
+  ResetOutput();
+  int refused = 0;
+  const char* failure = nullptr;
+  try {
+    refused = KOVA::APIRunner::Call(call.api.c_str(), call.version, call.method.c_str(), request,
+                                    response);
+  } catch (const std::exception& e) {
+    HostLog("runner: %s raised an exception: %s", Name(call).c_str(), e.what());
+    failure = "the handler raised an exception";
+  } catch (...) {
+    HostLog("runner: %s raised an exception", Name(call).c_str());
+    failure = "the handler raised an exception";
+  }
+  std::string output;
+  if (!TakeOutput(output)) failure = "the handler's output is too large";
+  if (failure != nullptr) return Error(KOVA::kAPIErrorUnknown, Reason(failure));
+  if (refused != 0) return Error(refused, Json::Value());
+  if (!response.IsOutputEnabled()) return {true, 0, std::move(output)};
+  if (!output.empty()) {
+    HostLog("runner: %s wrote %zu bytes to standard output with the envelope on; dropped",
+            Name(call).c_str(), output.size());
+  }
+  if (response.GetSettleCount() > 1) {
+    HostLog("runner: %s settled its answer %d times; the last one counts", Name(call).c_str(),
+            response.GetSettleCount());
+  }
+  switch (response.GetState()) {
+    case KOVA::APIResponse::State::kSuccess:
+      return {false, 0, ToJson(SuccessEnvelope(response.GetData()))};
+    case KOVA::APIResponse::State::kError:
+      return Error(response.GetErrorCode(), response.GetData());
+    case KOVA::APIResponse::State::kUnset:
+      break;
+  }
+  HostLog("runner: %s returned without an answer", Name(call).c_str());
+  return Error(KOVA::kAPIErrorUnknown, Reason("the handler gave no answer"));
+}
+
+int RunRunner(int fd, const RunnerSetup& setup) {
+  const pid_t parent = getppid();
+  signal(SIGINT, SIG_IGN);  // the monitor stops the runner
+  const int null = open("/dev/null", O_RDONLY | O_CLOEXEC);
+  const int output = memfd_create("kova-webapid-output", MFD_CLOEXEC);
+  if (null < 0 || output < 0 || dup2(null, STDIN_FILENO) < 0 || dup2(output, STDOUT_FILENO) < 0) {
+    HostLog("runner: cannot set up standard input and output");
+    return 1;
+  }
+  close(null);
+  close(output);
+  std::string error;
+  if (setup.account != nullptr && !TakeEffectiveIds(*setup.account, error)) {
+    HostLog("runner: cannot take the ids of %s: %s", setup.account->name.c_str(), error.c_str());
+    return 1;
+  }
+  // Set after the ids changed, which clears it; the runner ends with the monitor.
+  if (prctl(PR_SET_PDEATHSIG, SIGKILL) != 0 || getppid() != parent) return 1;
+  const IdSnapshot ids = SnapshotIds();
+  LoadModules(setup.modules_dir);
+  if (SendReady(fd, KOVA::APIRunner::List()) != IoResult::kOk) return 1;
+  FrameReader reader(fd);
+  for (;;) {
+    RunnerCall call;
+    const IoResult got = ReceiveCall(reader, call);
+    if (got == IoResult::kClosed) return 0;
+    if (got != IoResult::kOk) {
+      HostLog("runner: malformed call from the front-end");
+      return 1;
+    }
+    const RunnerAnswer answer = ExecuteCall(call);
+    bool changed = false;
+    const bool fit = RestoreIds(ids, changed, error);
+    if (changed) {
+      HostLog("warning: %s left the process's ids changed; %s", Name(call).c_str(),
+              fit ? "put back" : ("cannot put them back: " + error).c_str());
+    }
+    if (SendAnswer(fd, answer) != IoResult::kOk) return 1;
+    if (!fit) return 1;
+  }
+}
+
+}  // namespace kova_host

@@ -1,0 +1,83 @@
+#include "host/runner_protocol.h"
+
+#include "host/json_text.h"
+
+namespace kova_host {
+namespace {
+
+constexpr size_t kMaxMessage = size_t{2} << 20;  // a call carries at most a 1 MiB body
+
+IoResult ReadJson(FrameReader& reader, Json::Value& value, Clock::time_point deadline) {
+  std::string text;
+  const IoResult got = reader.Read(text, kMaxMessage, deadline);
+  if (got != IoResult::kOk) return got;
+  return FromJson(text, value) && value.isObject() ? IoResult::kOk : IoResult::kError;
+}
+
+bool IsText(const Json::Value& value) { return value.isString(); }
+
+}  // namespace
+
+IoResult SendReady(int fd, const Json::Value& methods) {
+  Json::Value message;
+  message["kind"] = "ready";
+  message["methods"] = methods;
+  return WriteFrame(fd, ToJson(message), kNoDeadline);
+}
+
+IoResult ReceiveReady(FrameReader& reader, Json::Value& methods, Clock::time_point deadline) {
+  Json::Value message;
+  const IoResult got = ReadJson(reader, message, deadline);
+  if (got != IoResult::kOk) return got;
+  if (message["kind"] != "ready" || !message["methods"].isArray()) return IoResult::kError;
+  methods = message["methods"];
+  return IoResult::kOk;
+}
+
+IoResult SendCall(int fd, const RunnerCall& call, Clock::time_point deadline) {
+  return WriteFrame(fd, EncodeCall(call), deadline);
+}
+
+std::string EncodeCall(const RunnerCall& call) {
+  Json::Value message;
+  message["api"] = call.api;
+  message["version"] = call.version;
+  message["method"] = call.method;
+  message["params"] = call.params;
+  message["user"] = call.user;
+  message["language"] = call.language;
+  return ToJson(message);
+}
+
+IoResult ReceiveCall(FrameReader& reader, RunnerCall& call) {
+  Json::Value message;
+  const IoResult got = ReadJson(reader, message, kNoDeadline);
+  if (got != IoResult::kOk) return got;
+  if (!IsText(message["api"]) || !message["version"].isInt() || !IsText(message["method"]) ||
+      !message["params"].isObject() || !IsText(message["user"]) || !IsText(message["language"])) {
+    return IoResult::kError;
+  }
+  call = {message["api"].asString(), message["version"].asInt(), message["method"].asString(),
+          message["params"],         message["user"].asString(), message["language"].asString()};
+  return IoResult::kOk;
+}
+
+IoResult SendAnswer(int fd, const RunnerAnswer& answer) {
+  Json::Value header;
+  header["kind"] = answer.raw ? "raw" : "json";
+  header["code"] = answer.code;
+  return WriteFrames(fd, ToJson(header), answer.body, kNoDeadline);
+}
+
+IoResult ReceiveAnswer(FrameReader& reader, RunnerAnswer& answer, Clock::time_point deadline) {
+  Json::Value header;
+  const IoResult got = ReadJson(reader, header, deadline);
+  if (got != IoResult::kOk) return got;
+  const Json::Value& kind = header["kind"];
+  if ((kind != "raw" && kind != "json") || !header["code"].isInt()) return IoResult::kError;
+  answer.raw = kind == "raw";
+  answer.code = header["code"].asInt();
+  return reader.Read(answer.body, kMaxFrame, deadline);
+}
+
+}  // namespace kova_host

@@ -1,0 +1,49 @@
+// What the front-end and the runner say to each other over their socket pair,
+// each message a frame of JSON:
+//   runner, once started:  {"kind": "ready", "methods": [{"api", "version", "method"}...]}
+//   front-end, a call:     {"api", "version", "method", "params", "user", "language"}
+//   runner, the answer:    {"kind": "json" | "raw", "code": CODE}, then one more frame:
+//                          the answer's envelope as JSON text ("json"), or everything
+//                          the handler wrote to standard output ("raw").
+
+#ifndef KOVA_HOST_RUNNER_PROTOCOL_H_
+#define KOVA_HOST_RUNNER_PROTOCOL_H_
+
+#include <json/value.h>
+
+#include <string>
+
+#include "host/frame.h"
+
+namespace kova_host {
+
+struct RunnerCall {
+  std::string api;
+  int version = 0;
+  std::string method;
+  Json::Value params;  // an object
+  std::string user;
+  std::string language;
+};
+
+struct RunnerAnswer {
+  bool raw = false;  // the handler turned the envelope off
+  int code = 0;      // the envelope's error code, 0 on success and for raw output
+  std::string body;  // the envelope's JSON text, or the raw output
+};
+
+IoResult SendReady(int fd, const Json::Value& methods);
+IoResult ReceiveReady(FrameReader& reader, Json::Value& methods, Clock::time_point deadline);
+
+// The frame's payload of a call, as SendCall writes it.
+std::string EncodeCall(const RunnerCall& call);
+IoResult SendCall(int fd, const RunnerCall& call, Clock::time_point deadline);
+// kError also for a frame that isn't a well-formed call.
+IoResult ReceiveCall(FrameReader& reader, RunnerCall& call);
+
+IoResult SendAnswer(int fd, const RunnerAnswer& answer);
+IoResult ReceiveAnswer(FrameReader& reader, RunnerAnswer& answer, Clock::time_point deadline);
+
+}  // namespace kova_host
+
+#endif  // KOVA_HOST_RUNNER_PROTOCOL_H_

@@ -1,0 +1,75 @@
+#include "host/runner_protocol.h"
+
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <thread>
+
+#include "host/json_text.h"
+
+namespace kova_host {
+namespace {
+
+class RunnerProtocolTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds_), 0);
+    reader_[0] = FrameReader(fds_[0]);
+    reader_[1] = FrameReader(fds_[1]);
+  }
+  void TearDown() override {
+    for (int fd : fds_) {
+      if (fd >= 0) close(fd);
+    }
+  }
+  int fds_[2] = {-1, -1};
+  FrameReader reader_[2] = {FrameReader(-1), FrameReader(-1)};
+};
+
+TEST_F(RunnerProtocolTest, CallsAndAnswersCrossWhole) {
+  Json::Value params;
+  params["filter"]["loglevel"] = "Warning";
+  const RunnerCall sent{"KOVA.ResourceMonitor.Log", 1, "list", params, "admin", "ger"};
+  ASSERT_EQ(SendCall(fds_[0], sent, kNoDeadline), IoResult::kOk);
+  RunnerCall got;
+  ASSERT_EQ(ReceiveCall(reader_[1], got), IoResult::kOk);
+  EXPECT_EQ(ToJson(got.params), ToJson(params));
+  EXPECT_EQ(got.api + got.method + got.user + got.language, "KOVA.ResourceMonitor.Loglistadminger");
+
+  // A raw answer larger than a socket buffer, with bytes that are no UTF-8.
+  std::string output = "Content-Type: text/csv\r\n\r\n" + std::string(3 << 20, '\xff');
+  std::thread writer([&] { EXPECT_EQ(SendAnswer(fds_[1], {true, 0, output}), IoResult::kOk); });
+  RunnerAnswer answer;
+  EXPECT_EQ(ReceiveAnswer(reader_[0], answer, Clock::now() + std::chrono::seconds(10)),
+            IoResult::kOk);
+  writer.join();
+  EXPECT_TRUE(answer.raw);
+  EXPECT_EQ(answer.body, output);
+}
+
+TEST_F(RunnerProtocolTest, ReportsTimeoutsClosedPeersAndMalformedFrames) {
+  RunnerAnswer answer;
+  EXPECT_EQ(ReceiveAnswer(reader_[0], answer, Clock::now() + std::chrono::milliseconds(50)),
+            IoResult::kTimeout);
+
+  ASSERT_EQ(WriteFrame(fds_[1], R"({"api": "x"})", kNoDeadline), IoResult::kOk);
+  RunnerCall call;
+  EXPECT_EQ(ReceiveCall(reader_[0], call), IoResult::kError);  // not a whole call
+  ASSERT_EQ(WriteFrame(fds_[1], "not json", kNoDeadline), IoResult::kOk);
+  EXPECT_EQ(ReceiveCall(reader_[0], call), IoResult::kError);
+
+  const char huge[4] = {'\x7f', '\x00', '\x00', '\x00'};  // 2 GiB announced
+  ASSERT_EQ(write(fds_[1], huge, sizeof(huge)), 4);
+  std::string payload;
+  EXPECT_EQ(reader_[0].Read(payload, kMaxFrame, kNoDeadline), IoResult::kTooLarge);
+
+  reader_[0] = FrameReader(fds_[0]);  // a reader past a frame too large is done with
+  close(fds_[1]);
+  fds_[1] = -1;
+  EXPECT_EQ(ReceiveAnswer(reader_[0], answer, kNoDeadline), IoResult::kClosed);
+  EXPECT_EQ(SendCall(fds_[0], call, kNoDeadline), IoResult::kClosed);
+}
+
+}  // namespace
+}  // namespace kova_host

@@ -1,0 +1,319 @@
+#include "host/web_entry.h"
+
+#include <exception>
+#include <map>
+#include <set>
+
+#include "host/access_log.h"
+#include "host/cgi_output.h"
+#include "host/host_log.h"
+#include "host/json_text.h"
+#include "kova/webapi.h"
+
+namespace kova_host {
+
+constexpr char kInfoApi[] = "KOVA.API.Info";
+constexpr char kAuthApi[] = "KOVA.API.Auth";
+
+// The decoded call: its parameters' texts, and the API, version and method.
+struct WebEntry::Call {
+  std::map<std::string, std::string> fields;
+  std::string api, method;
+  int version = 0;
+
+  const std::string* Field(const std::string& name) const {
+    auto it = fields.find(name);
+    return it == fields.end() ? nullptr : &it->second;
+  }
+};
+
+namespace {
+
+const std::set<std::string> kHostParams = {"api", "version", "method", "_sid", "_token"};
+
+EntryReply Json(const Json::Value& envelope, int status = 200) {
+  EntryReply reply;
+  reply.status = status;
+  reply.body = ToJson(envelope);
+  reply.headers.emplace_back("Cache-Control", "no-store");
+  CurrentAccess().code = envelope["success"].asBool() ? 0 : envelope["error"]["code"].asInt();
+  return reply;
+}
+
+EntryReply Error(int code, const std::string& reason, int status = 200) {
+  return Json(ErrorReason(code, reason), status);
+}
+
+bool ParseVersion(const std::string& text, int& version) {
+  if (text.empty() || text.size() > 9 || text.find_first_not_of("0123456789") != text.npos) {
+    return false;
+  }
+  version = std::stoi(text);
+  return true;
+}
+
+// The value of cookie `name` in a Cookie header, "" when absent.
+std::string CookieValue(const std::string& header, const std::string& name) {
+  size_t start = 0;
+  while (start < header.size()) {
+    size_t end = header.find(';', start);
+    if (end == std::string::npos) end = header.size();
+    std::string pair = header.substr(start, end - start);
+    pair.erase(0, pair.find_first_not_of(' '));
+    if (pair.compare(0, name.size() + 1, name + "=") == 0) return pair.substr(name.size() + 1);
+    start = end + 1;
+  }
+  return "";
+}
+
+// Compares in time that depends on the lengths only.
+bool SameText(const std::string& a, const std::string& b) {
+  unsigned char differ = a.size() != b.size();
+  for (size_t i = 0; i < a.size() && i < b.size(); ++i) differ |= a[i] ^ b[i];
+  return differ == 0;
+}
+
+// The interface language: a "lang" parameter of three letters ("enu", "ger"),
+// else German when Accept-Language puts it first, else English.
+std::string Language(const std::string* param, const std::string& accept) {
+  if (param != nullptr && param->size() == 3 &&
+      param->find_first_not_of("abcdefghijklmnopqrstuvwxyz") == std::string::npos) {
+    return *param;
+  }
+  const std::string first = accept.substr(0, accept.find_first_of(",;-_ "));
+  if (first == "de") return "ger";
+  return "enu";
+}
+
+std::string SessionCookie(const std::string& sid) {
+  return std::string(kSessionCookie) + "=" + sid + (sid.empty() ? "; Max-Age=0" : "") +
+         "; Path=/; HttpOnly; SameSite=Strict";
+}
+
+}  // namespace
+
+EntryReply WebEntry::Handle(const EntryRequest& request) {
+  try {
+    Call call;
+    return Dispatch(request, call);
+  } catch (const std::exception& e) {
+    HostLog("entry: %s", e.what());
+  } catch (...) {
+    HostLog("entry: unknown exception");
+  }
+  return Error(KOVA::kAPIErrorUnknown, "the host failed", 500);
+}
+
+EntryReply WebEntry::Dispatch(const EntryRequest& request, Call& call) {
+  FormFields fields;
+  std::string error;
+  if (!DecodeForm(request.query, fields, error)) {
+    return Error(KOVA::kAPIErrorBadParameter, error, 400);
+  }
+  if (request.http_method == "POST") {
+    const std::string type = request.content_type.substr(0, request.content_type.find(';'));
+    if (!type.empty() && type != "application/x-www-form-urlencoded") {
+      return Error(KOVA::kAPIErrorBadParameter,
+                   "send parameters as application/x-www-form-urlencoded", 415);
+    }
+    if (!DecodeForm(request.body, fields, error)) {
+      return Error(KOVA::kAPIErrorBadParameter, error, 400);
+    }
+  }
+  if (fields.size() > kMaxParams) {
+    return Error(KOVA::kAPIErrorBadParameter,
+                 "more than " + std::to_string(kMaxParams) + " parameters", 400);
+  }
+  for (auto& [name, value] : fields) {
+    if (!call.fields.emplace(name, std::move(value)).second) {
+      return Error(KOVA::kAPIErrorBadParameter, "parameter " + name + " comes twice", 400);
+    }
+  }
+  for (const char* name : {"api", "version", "method"}) {
+    if (call.Field(name) == nullptr || call.Field(name)->empty()) {
+      return Error(KOVA::kAPIErrorBadParameter, std::string("missing parameter ") + name);
+    }
+  }
+  call.api = *call.Field("api");
+  call.method = *call.Field("method");
+  AccessRecord& access = CurrentAccess();
+  access.api = call.api;
+  access.method = call.method;
+  if (!ParseVersion(*call.Field("version"), call.version)) {
+    return Error(KOVA::kAPIErrorBadParameter, "version must be a whole number");
+  }
+  if (call.api == kInfoApi || call.api == kAuthApi) {
+    if (call.version != 1) return Error(KOVA::kAPIErrorBadVersion, "no such version");
+    if (call.api == kInfoApi && call.method == "query") return Info();
+    if (call.api == kAuthApi && call.method == "login") return SignIn(request, call);
+    if (call.api == kAuthApi && call.method == "logout") return SignOut(request, call);
+    return Error(KOVA::kAPIErrorNoSuchMethod, "no such method");
+  }
+  return RunModule(request, call);
+}
+
+EntryReply WebEntry::Info() const {
+  // api -> version -> methods, the host's own APIs first.
+  std::map<std::string, std::map<int, std::vector<std::string>>> apis;
+  apis[kAuthApi][1] = {"login", "logout"};
+  apis[kInfoApi][1] = {"query"};
+  for (const Json::Value& row : *runner_.Methods()) {
+    apis[row["api"].asString()][row["version"].asInt()].push_back(row["method"].asString());
+  }
+  Json::Value list(Json::arrayValue);
+  for (const auto& [api, versions] : apis) {
+    Json::Value entry;
+    entry["api"] = api;
+    entry["admin"] = api != kAuthApi && api != kInfoApi;
+    entry["versions"] = Json::Value(Json::arrayValue);
+    for (const auto& [version, methods] : versions) {
+      Json::Value item;
+      item["version"] = version;
+      item["methods"] = Json::Value(Json::arrayValue);
+      for (const std::string& method : methods) item["methods"].append(method);
+      entry["versions"].append(item);
+    }
+    list.append(entry);
+  }
+  Json::Value data;
+  data["apis"] = list;
+  return Json(SuccessEnvelope(data));
+}
+
+EntryReply WebEntry::SignIn(const EntryRequest& request, const Call& call) {
+  if (request.http_method != "POST") {
+    return Error(KOVA::kAPIErrorBadParameter, "sign in with a POST request");
+  }
+  const std::string* account = call.Field("account");
+  const std::string* password = call.Field("password");
+  if (account == nullptr || account->empty() || password == nullptr || password->empty() ||
+      account->size() > 64 || password->size() > kMaxPassword) {
+    return Error(KOVA::kAPIErrorBadParameter, "give an account and a password");
+  }
+  CurrentAccess().user = *account;
+  const std::vector<std::string> keys = {"account:" + *account, "address:" + request.remote_addr};
+  const TimePoint now = std::chrono::steady_clock::now();
+  if (const int wait = throttle_.WaitSeconds(keys, now); wait > 0) {
+    Json::Value errors;
+    errors["reason"] = "too many failed sign-ins; try again later";
+    errors["retry_after"] = wait;
+    EntryReply reply = Json(ErrorEnvelope(kErrorSignInThrottled, errors));
+    reply.headers.emplace_back("Retry-After", std::to_string(wait));
+    return reply;
+  }
+  bool admin = false;
+  const int checked = check_password_(*account, *password, admin);
+  if (checked < 0) return Error(KOVA::kAPIErrorUnknown, "the accounts can't be read");
+  if (checked == 0) {
+    throttle_.Failed(keys, std::chrono::steady_clock::now());
+    return Error(kErrorSignInFailed, "wrong account name or password");
+  }
+  throttle_.Succeeded(keys);
+  Session session;
+  const std::string sid =
+      sessions_.Create(*account, admin, Language(call.Field("lang"), request.accept_language),
+                       std::chrono::steady_clock::now(), session);
+  Json::Value data;
+  data["sid"] = sid;
+  data["token"] = session.token;
+  data["account"] = *account;
+  data["admin"] = admin;
+  EntryReply reply = Json(SuccessEnvelope(data));
+  reply.headers.emplace_back("Set-Cookie", SessionCookie(sid));
+  return reply;
+}
+
+EntryReply WebEntry::SignOut(const EntryRequest& request, const Call& call) {
+  std::string sid;
+  Session session;
+  EntryReply refused;
+  if (!FindSession(request, call, sid, session, refused)) return refused;
+  sessions_.Remove(sid);
+  EntryReply reply = Json(SuccessEnvelope(Json::Value()));
+  reply.headers.emplace_back("Set-Cookie", SessionCookie(""));
+  return reply;
+}
+
+bool WebEntry::FindSession(const EntryRequest& request, const Call& call, std::string& sid,
+                           Session& session, EntryReply& refused) {
+  const std::string* sid_param = call.Field("_sid");
+  const bool by_cookie = sid_param == nullptr;
+  sid = by_cookie ? CookieValue(request.cookie, kSessionCookie) : *sid_param;
+  if (sid.empty()) {
+    refused = Error(KOVA::kAPIErrorNoSession, "not signed in");
+    return false;
+  }
+  const TimePoint now = std::chrono::steady_clock::now();
+  const std::optional<Session> found = sessions_.Find(sid, now);
+  if (!found) {
+    refused = Error(KOVA::kAPIErrorNoSession, "the session is unknown or has expired");
+    return false;
+  }
+  CurrentAccess().user = found->account;
+  if (by_cookie) {
+    const std::string* token_param = call.Field("_token");
+    const std::string token = !request.token_header.empty() ? request.token_header
+                              : token_param != nullptr      ? *token_param
+                                                            : "";
+    if (token.empty() || !SameText(token, found->token)) {
+      refused = Error(KOVA::kAPIErrorBadToken, "the session's token is missing or wrong");
+      return false;
+    }
+  }
+  sessions_.Touch(sid, now);
+  session = *found;
+  return true;
+}
+
+EntryReply WebEntry::RunModule(const EntryRequest& request, const Call& call) {
+  const std::shared_ptr<const Json::Value> methods = runner_.Methods();
+  // Before any runner started, the runner itself tells of missing methods.
+  bool api_known = methods->empty(), version_known = api_known, method_known = api_known;
+  for (const Json::Value& row : *methods) {
+    if (row["api"].asString() != call.api) continue;
+    api_known = true;
+    if (row["version"].asInt() != call.version) continue;
+    version_known = true;
+    method_known = method_known || row["method"].asString() == call.method;
+  }
+  if (!api_known) return Error(KOVA::kAPIErrorNoSuchAPI, "no such API");
+  if (!version_known) return Error(KOVA::kAPIErrorBadVersion, "no such version");
+  if (!method_known) return Error(KOVA::kAPIErrorNoSuchMethod, "no such method");
+
+  std::string sid;
+  Session session;
+  EntryReply refused;
+  if (!FindSession(request, call, sid, session, refused)) return refused;
+  if (!session.admin) return Error(KOVA::kAPIErrorNotPermitted, "for administrators only");
+
+  RunnerCall runner_call{call.api,        call.version,
+                         call.method,     Json::Value(Json::objectValue),
+                         session.account, session.language};
+  for (const auto& [name, text] : call.fields) {
+    if (kHostParams.count(name) == 0) runner_call.params[name] = ParamValue(text);
+  }
+  RunnerAnswer answer;
+  std::string error;
+  if (!runner_.Call(runner_call, answer, error)) {
+    return Error(KOVA::kAPIErrorUnknown, error + "; the call was abandoned");
+  }
+  CurrentAccess().code = answer.code;
+  EntryReply reply;
+  if (!answer.raw) {
+    reply.body = std::move(answer.body);
+    reply.headers.emplace_back("Cache-Control", "no-store");
+    return reply;
+  }
+  CgiReply cgi;
+  if (!ParseCgiOutput(answer.body, cgi, error)) {
+    HostLog("%s v%d %s: %s", call.api.c_str(), call.version, call.method.c_str(), error.c_str());
+    return Error(KOVA::kAPIErrorUnknown, "the handler's output is malformed");
+  }
+  reply.status = cgi.status;
+  reply.content_type = cgi.content_type;
+  reply.body = std::move(cgi.body);
+  for (auto& header : cgi.headers) reply.headers.push_back(std::move(header));
+  return reply;
+}
+
+}  // namespace kova_host

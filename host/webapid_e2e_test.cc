@@ -1,0 +1,458 @@
+// kova-webapid started for real on a free port over a temporary system root,
+// called over HTTP like a browser would.
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <httplib.h>
+#include <pwd.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <regex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "fake/host_call.h"
+#include "src/test_root.h"
+
+namespace {
+
+using kova_fake::ParseJson;
+using ::testing::HasSubstr;
+using ::testing::Not;
+
+constexpr char kEntry[] = "/webapi/entry.cgi";
+constexpr char kAdminPassword[] = "admin pw: 5ecret!";
+constexpr char kGuestPassword[] = "guest-pw";
+
+// The performance-event daemon as a script that only waits.
+constexpr char kDaemon[] = "trap 'exit 0' TERM\nwhile :; do sleep 0.05; done\n";
+
+std::string Escape(const std::string& text) { return httplib::detail::encode_query_param(text); }
+
+// A form-encoded body or query: Form({{"api", "X"}, {"version", "1"}}).
+std::string Form(const std::vector<std::pair<std::string, std::string>>& fields) {
+  std::string out;
+  for (const auto& [name, value] : fields) {
+    out += (out.empty() ? "" : "&") + Escape(name) + "=" + Escape(value);
+  }
+  return out;
+}
+
+// A kova-webapid over the test's root; stopped with SIGTERM at the end.
+class Host {
+ public:
+  Host(const kova::TestRoot& root, const std::vector<std::string>& args)
+      : log_(root.Path("/host.log")) {
+    std::vector<std::string> argv = {KOVA_WEBAPID_PATH,     "--port",   "0",         "--modules",
+                                     root.Path("/modules"), "--static", KOVA_WWW_DIR};
+    argv.insert(argv.end(), args.begin(), args.end());
+    pid_ = fork();
+    if (pid_ == 0) {
+      freopen(log_.c_str(), "w", stderr);
+      std::vector<char*> raw;
+      for (std::string& arg : argv) raw.push_back(arg.data());
+      raw.push_back(nullptr);
+      execv(raw[0], raw.data());
+      _exit(127);
+    }
+    const std::regex listening("listening on http://127.0.0.1:([0-9]+)/");
+    for (int i = 0; i < 200 && port_ == 0; ++i) {
+      std::smatch match;
+      const std::string log = Log();
+      if (std::regex_search(log, match, listening)) port_ = std::stoi(match[1]);
+      if (port_ == 0) std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    }
+    EXPECT_NE(port_, 0) << Log();
+  }
+  ~Host() {
+    kill(pid_, SIGTERM);
+    int status = 0;
+    for (int i = 0; i < 100 && waitpid(pid_, &status, WNOHANG) == 0; ++i) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    }
+    if (waitpid(pid_, &status, WNOHANG) == 0) {
+      ADD_FAILURE() << "kova-webapid did not stop on SIGTERM:\n" << Log();
+      kill(pid_, SIGKILL);
+      waitpid(pid_, &status, 0);
+    }
+  }
+  Host(const Host&) = delete;
+  Host& operator=(const Host&) = delete;
+
+  int port() const { return port_; }
+  std::string Log() const {
+    std::ifstream in(log_);
+    return std::string(std::istreambuf_iterator<char>(in), {});
+  }
+
+ private:
+  std::string log_;
+  pid_t pid_ = -1;
+  int port_ = 0;
+};
+
+struct Reply {
+  int status = 0;
+  Json::Value json;  // null when the body is no JSON
+  std::string body;
+  httplib::Headers headers;
+};
+
+class WebApidTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    std::filesystem::create_directories(root_.Path("/usr/share/kova"));
+    std::filesystem::copy(KOVA_TEXTS_DIR, root_.Path("/usr/share/kova/texts"),
+                          std::filesystem::copy_options::recursive);
+    root_.Write("/opt/kovaperfeventd.sh", kDaemon, 0755);
+    root_.Write("/etc/kova/services/kovaperfeventd.conf",
+                "command=\"/bin/sh " + root_.Path("/opt/kovaperfeventd.sh") + "\"\n");
+    root_.Write("/etc/kova/services/pkgctl-MediaServer.conf", "command=\"/bin/sleep 300\"\n");
+    root_.Write("/var/packages/MediaServer/INFO",
+                "displayname=\"Media Server\"\ndisplayname_ger=\"Medienserver\"\n");
+    root_.Write("/etc/kovainfo.conf", "support_performance_event_internal=\"yes\"\n");
+    std::filesystem::create_directories(root_.Path("/modules"));
+    std::filesystem::create_directories(root_.Path("/run/kova"));
+    AddModule(KOVA_MODULE_PATH);
+    Kova("user add admin --admin", kAdminPassword);
+    Kova("user add guest", kGuestPassword);
+    Kova("lun add --size-mb 2048 lun-uuid-1 'Backup LUN'");
+    Kova("log write Warning 'CPU of smb at 93%'");
+    Kova("log write Critical 'Memory at 99%, swapping'");
+  }
+  void TearDown() override {
+    host_.reset();
+    Kova("service stop kovaperfeventd");
+  }
+
+  void AddModule(const std::string& path) {
+    std::filesystem::create_symlink(
+        path, root_.Path("/modules/") + std::filesystem::path(path).filename().string());
+  }
+
+  void Kova(const std::string& args, const std::string& input = "") {
+    FILE* command = popen((std::string(KOVA_TOOL_PATH) + " " + args + " >/dev/null").c_str(), "w");
+    ASSERT_NE(command, nullptr);
+    fputs((input + "\n").c_str(), command);
+    pclose(command);
+  }
+
+  void Start(const std::vector<std::string>& args = {}) {
+    host_ = std::make_unique<Host>(root_, args);
+  }
+
+  Reply Send(const std::string& method, const std::string& form, const httplib::Headers& headers) {
+    httplib::Client client("127.0.0.1", host_->port());
+    client.set_read_timeout(std::chrono::seconds(30));
+    httplib::Result result =
+        method == "GET" ? client.Get(std::string(kEntry) + "?" + form, headers)
+                        : client.Post(kEntry, headers, form, "application/x-www-form-urlencoded");
+    Reply reply;
+    if (!result) {
+      ADD_FAILURE() << "no answer to " << form;
+      return reply;
+    }
+    reply.status = result->status;
+    reply.body = result->body;
+    reply.headers = result->headers;
+    try {
+      reply.json = ParseJson(result->body);
+    } catch (const std::exception&) {
+    }
+    return reply;
+  }
+
+  // Calls api/method, version 1, with `params` and the session of `sid` as a parameter.
+  Reply Call(const std::string& api, const std::string& method,
+             std::vector<std::pair<std::string, std::string>> params = {},
+             const std::string& sid = "", const httplib::Headers& headers = {}) {
+    params.insert(params.begin(), {{"api", api}, {"version", "1"}, {"method", method}});
+    if (!sid.empty()) params.emplace_back("_sid", sid);
+    return Send("POST", Form(params), headers);
+  }
+
+  Reply SignIn(const std::string& account, const std::string& password) {
+    return Call("KOVA.API.Auth", "login", {{"account", account}, {"password", password}});
+  }
+  std::string Sid(const std::string& account, const std::string& password) {
+    return SignIn(account, password).json["data"]["sid"].asString();
+  }
+
+  static int Code(const Reply& reply) { return reply.json["error"]["code"].asInt(); }
+
+  kova::TestRoot root_;
+  std::unique_ptr<Host> host_;
+};
+
+constexpr char kSetting[] = "KOVA.ResourceMonitor.Setting";
+constexpr char kLog[] = "KOVA.ResourceMonitor.Log";
+constexpr char kRule[] = "KOVA.ResourceMonitor.EventRule";
+
+TEST_F(WebApidTest, ServesEveryMethodOfTheModule) {
+  Start();
+  const Reply info = Call("KOVA.API.Info", "query");  // no sign-in needed
+  EXPECT_THAT(info.body, HasSubstr(R"({"admin":true,"api":"KOVA.ResourceMonitor.EventRule",)"
+                                   R"("versions":[{"methods":["delete","get","list","onoff",)"
+                                   R"("set"],"version":1}]})"));
+  EXPECT_THAT(info.body, HasSubstr(R"("api":"KOVA.Core.ISCSI.LUN")"));
+
+  const std::string sid = Sid("admin", kAdminPassword);
+  ASSERT_FALSE(sid.empty());
+  EXPECT_EQ(Call(kSetting, "get", {}, sid).json,
+            ParseJson(R"({"success": true, "data": {"duration": 15, "enable_history": false,
+                                                     "enable_event": false}})"));
+  // "45" and "true" arrive as JSON values; "yes" stays text, which the module refuses.
+  EXPECT_EQ(Call(kSetting, "set", {{"duration", "45"}, {"enable_event", "true"}}, sid).json,
+            ParseJson(R"({"success": true})"));
+  EXPECT_THAT(root_.Read("/etc/kovainfo.conf"),
+              ::testing::ContainsRegex("resourcemonitor_realtime_max=\"?30\"?\n"));
+  EXPECT_FALSE(Call(kSetting, "set", {{"enable_event", "yes"}}, sid).json["success"].asBool());
+  EXPECT_EQ(Call(kSetting, "get", {}, sid).json["data"]["enable_event"], true);
+
+  const Reply warnings =
+      Call(kLog, "list", {{"filter", R"({"loglevel":"Warning"})"}, {"limit", "10"}}, sid);
+  EXPECT_EQ(warnings.json["data"]["total"], 1);
+  EXPECT_EQ(warnings.json["data"]["logs"][0]["event"], "CPU of smb at 93%");
+
+  const Reply exported = Send(
+      "GET",
+      Form({{"api", kLog}, {"version", "1"}, {"method", "export"}, {"type", "csv"}, {"_sid", sid}}),
+      {});
+  EXPECT_EQ(exported.status, 200);
+  EXPECT_EQ(exported.headers.find("Content-Type")->second, "text/csv");
+  EXPECT_THAT(exported.headers.find("Content-Disposition")->second,
+              ::testing::MatchesRegex(R"(attachment; filename="ResourceMonitor-.*\.csv")"));
+  EXPECT_THAT(exported.body, ::testing::StartsWith("Time,Level,Event,\r\n"));
+  EXPECT_THAT(exported.body, HasSubstr(",Critical,\"Memory at 99%, swapping\",\r\n"));
+  EXPECT_EQ(Call(kLog, "clear", {}, sid).json, ParseJson(R"({"success": true})"));
+  EXPECT_EQ(Call(kLog, "list", {}, sid).json["data"]["total"], 0);
+
+  const std::vector<std::pair<std::string, std::string>> rule = {
+      {"type", "2"},     {"service", "lun-uuid-1"}, {"severity", "1"},
+      {"resource", "3"}, {"threshold", "80"},       {"enable", "true"}};
+  EXPECT_EQ(Call(kRule, "set", rule, sid).json, ParseJson(R"({"success": true})"));
+  const Reply rules = Call(kRule, "list", {}, sid);
+  ASSERT_EQ(rules.json["data"]["total"], 1) << rules.body;
+  const std::string id = rules.json["data"]["rules"][0]["id"].asString();
+  EXPECT_EQ(rules.json["data"]["rules"][0]["name"], "Backup LUN");  // through the LUN API
+  EXPECT_EQ(rules.json["data"]["support_internal"], 1);
+  // Ids are text: id=1 arrives as a number, id="1" as the text.
+  EXPECT_EQ(Code(Call(kRule, "get", {{"id", id}}, sid)), 101);
+  EXPECT_EQ(Call(kRule, "get", {{"id", "\"" + id + "\""}}, sid).json["data"]["threshold"], 80);
+  EXPECT_EQ(Call(kRule, "onoff", {{"id_list", R"([{"id":")" + id + R"(","enable":false}])"}}, sid)
+                .json["success"],
+            true);
+  EXPECT_EQ(Call(kRule, "get", {{"id", "\"" + id + "\""}}, sid).json["data"]["enable"], false);
+  EXPECT_EQ(Code(Call(kRule, "delete", {{"id_list", id}}, sid)), 101);  // a number, no list
+  EXPECT_EQ(Call(kRule, "delete", {{"id_list", R"([")" + id + R"("])"}}, sid).json["success"],
+            true);
+  EXPECT_EQ(Call(kRule, "list", {}, sid).json["data"]["total"], 0);
+
+  httplib::Client client("127.0.0.1", host_->port());
+  EXPECT_THAT(client.Get("/")->body, HasSubstr("KOVA Resource Monitor"));
+
+  const std::string log = host_->Log();
+  EXPECT_THAT(log, HasSubstr("POST /webapi/entry.cgi 200 api=KOVA.ResourceMonitor.Setting "
+                             "method=set user=admin code=0 ms="));
+  EXPECT_THAT(log, Not(HasSubstr(sid)));
+  EXPECT_THAT(log, Not(HasSubstr("5ecret")));
+}
+
+const std::vector<std::pair<std::string, std::string>> kMethods = {
+    {kSetting, "set"}, {kSetting, "get"}, {kLog, "list"}, {kLog, "clear"},   {kLog, "export"},
+    {kRule, "list"},   {kRule, "get"},    {kRule, "set"}, {kRule, "delete"}, {kRule, "onoff"},
+};
+
+TEST_F(WebApidTest, EveryMethodNeedsASignedInAdministrator) {
+  Start({"--idle-timeout", "2"});
+  const std::string expired = Sid("admin", kAdminPassword);
+  std::this_thread::sleep_for(std::chrono::milliseconds(2200));
+  const Reply wrong = SignIn("admin", "not the password");
+  EXPECT_EQ(Code(wrong), 108);
+  EXPECT_FALSE(wrong.json["data"].isMember("sid"));
+
+  const Reply admin = SignIn("admin", kAdminPassword);
+  const std::string cookie = "kova_sid=" + admin.json["data"]["sid"].asString();
+  const std::string token = admin.json["data"]["token"].asString();
+  EXPECT_EQ(admin.headers.find("Set-Cookie")->second,
+            cookie + "; Path=/; HttpOnly; SameSite=Strict");
+  const std::string guest = Sid("guest", kGuestPassword);
+
+  const struct {
+    const char* what;
+    std::string sid;
+    httplib::Headers headers;
+    int code;
+  } cases[] = {
+      {"no session", "", {}, 106},
+      {"an unknown session", "0123abcd", {}, 106},
+      {"the cookie without its token", "", {{"Cookie", cookie}}, 107},
+      {"the cookie with a wrong token",
+       "",
+       {{"Cookie", cookie}, {"X-KOVA-Token", "x" + token}},
+       107},
+      {"an expired session", expired, {}, 106},
+      {"a user who is no administrator", guest, {}, 105},
+  };
+  for (const auto& c : cases) {
+    for (const auto& [api, method] : kMethods) {
+      EXPECT_EQ(Code(Call(api, method, {}, c.sid, c.headers)), c.code)
+          << c.what << ": " << api << " " << method;
+    }
+  }
+  // The cookie with its token, as header or parameter, passes.
+  EXPECT_TRUE(Call(kSetting, "get", {}, "", {{"Cookie", cookie}, {"X-KOVA-Token", token}})
+                  .json["success"]
+                  .asBool());
+  EXPECT_TRUE(Call(kSetting, "get", {{"_token", token}}, "", {{"Cookie", cookie}})
+                  .json["success"]
+                  .asBool());
+  const Reply out =
+      Call("KOVA.API.Auth", "logout", {}, "", {{"Cookie", cookie}, {"X-KOVA-Token", token}});
+  EXPECT_TRUE(out.json["success"].asBool());
+  EXPECT_THAT(out.headers.find("Set-Cookie")->second, HasSubstr("Max-Age=0"));
+  EXPECT_EQ(Code(Call(kSetting, "get", {}, "", {{"Cookie", cookie}, {"X-KOVA-Token", token}})),
+            106);
+}
+
+TEST_F(WebApidTest, RepeatedFailedSignInsAreSlowedDown) {
+  Start();
+  for (int i = 0; i < 5; ++i) EXPECT_EQ(Code(SignIn("admin", "guess " + std::to_string(i))), 108);
+  const Reply throttled = SignIn("admin", kAdminPassword);
+  EXPECT_EQ(Code(throttled), 109);
+  EXPECT_GE(throttled.json["error"]["errors"]["retry_after"].asInt(), 1);
+  EXPECT_EQ(throttled.headers.find("Retry-After")->second,
+            throttled.json["error"]["errors"]["retry_after"].asString());
+  std::this_thread::sleep_for(std::chrono::milliseconds(1100));
+  EXPECT_TRUE(SignIn("admin", kAdminPassword).json["success"].asBool());
+}
+
+TEST_F(WebApidTest, AModuleThatCrashesOrHangsDoesNotTakeTheHostDown) {
+  AddModule(KOVA_CRASH_MODULE_PATH);
+  Start({"--call-timeout", "1"});
+  const std::string sid = Sid("admin", kAdminPassword);
+  const auto pid = [&] { return Call("KOVA.Test.Crash", "echo", {}, sid).json["data"]["pid"]; };
+  const Json::Value first = pid();
+  ASSERT_TRUE(first.isInt());
+
+  // Calls that wait behind the one that crashes are answered by a fresh runner.
+  std::thread crash([&] {
+    EXPECT_EQ(Code(Call("KOVA.Test.Crash", "abort", {{"delay_ms", "300"}}, sid)), 100);
+  });
+  std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  std::vector<std::thread> waiting;
+  for (int i = 0; i < 3; ++i) {
+    waiting.emplace_back(
+        [&] { EXPECT_TRUE(Call(kSetting, "get", {}, sid).json["success"].asBool()); });
+  }
+  crash.join();
+  for (std::thread& thread : waiting) thread.join();
+  const Json::Value second = pid();
+  EXPECT_NE(second, first);  // a fresh runner
+
+  const auto start = std::chrono::steady_clock::now();
+  const Reply late = Call("KOVA.Test.Crash", "sleep", {{"seconds", "30"}}, sid);
+  EXPECT_EQ(Code(late), 100);
+  EXPECT_THAT(late.json["error"]["errors"]["reason"].asString(), HasSubstr("time limit"));
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(5));
+  EXPECT_NE(pid(), second);
+
+  const Reply raw = Call("KOVA.Test.Crash", "raw", {}, sid);
+  EXPECT_EQ(raw.status, 202);
+  EXPECT_EQ(raw.body, "hello\n");
+  EXPECT_EQ(raw.headers.find("X-Test")->second, "yes");
+  EXPECT_EQ(raw.headers.find("Content-Type")->second, "text/plain");
+  const struct {
+    const char* method;
+    int code;
+  } failures[] = {{"garbage", 100}, {"throw", 100}, {"refused", 105}};
+  for (const auto& c : failures) {
+    EXPECT_EQ(Code(Call("KOVA.Test.Crash", c.method, {}, sid)), c.code) << c.method;
+  }
+
+  // Parameters reach the handler decoded, without the host's own.
+  const Reply echo = Call("KOVA.Test.Crash", "echo", {{"value", R"({"a":[1,"b"]})"}}, sid);
+  EXPECT_EQ(echo.json["data"]["value"], ParseJson(R"({"a": [1, "b"]})"));
+  EXPECT_EQ(echo.json["data"]["user"], "admin");
+  EXPECT_EQ(echo.json["data"]["has_sid"], false);
+  EXPECT_EQ(echo.json["data"]["language"], "enu");
+  const Reply german =
+      Call("KOVA.API.Auth", "login", {{"account", "admin"}, {"password", kAdminPassword}}, "",
+           {{"Accept-Language", "de-DE,de;q=0.9,en;q=0.5"}});
+  EXPECT_EQ(Call("KOVA.Test.Crash", "echo", {}, german.json["data"]["sid"].asString())
+                .json["data"]["language"],
+            "ger");
+  EXPECT_EQ(Call("KOVA.Test.Crash", "echo", {{"value", "csv"}}, sid).json["data"]["value"], "csv");
+  EXPECT_THAT(host_->Log(), HasSubstr("killed by signal 6"));
+}
+
+TEST_F(WebApidTest, IdsThatAModuleLeavesRaisedDoNotReachTheNextCall) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root";
+  AddModule(KOVA_IDS_MODULE_PATH);
+  Start();
+  const std::string sid = Sid("admin", kAdminPassword);
+  const passwd* nobody = getpwnam("nobody");
+  ASSERT_NE(nobody, nullptr);
+  const Json::Value before = Call("KOVA.Test.Ids", "ids", {}, sid).json["data"];
+  EXPECT_EQ(before["euid"].asUInt(), nobody->pw_uid);
+  EXPECT_EQ(before["ruid"], 0);
+  EXPECT_EQ(before["suid"], 0);
+  EXPECT_EQ(Call("KOVA.Test.Ids", "raise", {}, sid).json["data"]["euid"], 0);
+  EXPECT_EQ(Call("KOVA.Test.Ids", "ids", {}, sid).json["data"], before);
+  EXPECT_THAT(host_->Log(), HasSubstr("warning: KOVA.Test.Ids v1 raise left the process's ids "
+                                      "changed; put back"));
+}
+
+TEST_F(WebApidTest, RefusesBadInputWithAClearError) {
+  Start();
+  const std::string sid = Sid("admin", kAdminPassword);
+  std::string many = "api=KOVA.API.Info&version=1&method=query";
+  for (int i = 0; i < 100; ++i) many += "&p" + std::to_string(i) + "=1";
+  const std::string big =
+      "api=KOVA.API.Info&version=1&method=query&pad=" + std::string((1 << 20) + 1, 'a');
+  const struct {
+    const char* what;
+    std::string method;
+    std::string form;
+    int status;
+    int code;
+  } cases[] = {
+      {"a body over 1 MiB", "POST", big, 413, 101},
+      {"broken percent-encoding", "GET", "api=KOVA.API.Info&version=1&method=%zz", 400, 101},
+      {"too many parameters", "POST", many, 400, 101},
+      {"a parameter twice", "GET", "api=KOVA.API.Info&api=x&version=1&method=query", 400, 101},
+      {"a version that is no number", "GET", "api=KOVA.API.Info&version=one&method=query", 200,
+       101},
+      {"no api", "GET", "version=1&method=query", 200, 101},
+      {"no method", "GET", "api=KOVA.API.Info&version=1", 200, 101},
+      {"an unknown API", "GET", "api=KOVA.Nothing&version=1&method=get", 200, 102},
+      {"an unknown method", "GET", Form({{"api", kSetting}, {"version", "1"}, {"method", "drop"}}),
+       200, 103},
+      {"an unknown version", "GET", Form({{"api", kSetting}, {"version", "2"}, {"method", "get"}}),
+       200, 104},
+      {"a sign-in by GET", "GET",
+       Form({{"api", "KOVA.API.Auth"},
+             {"version", "1"},
+             {"method", "login"},
+             {"account", "admin"},
+             {"password", kAdminPassword}}),
+       200, 101},
+  };
+  for (const auto& c : cases) {
+    const Reply reply = Send(c.method, c.form, {});
+    EXPECT_EQ(reply.status, c.status) << c.what;
+    EXPECT_EQ(Code(reply), c.code) << c.what;
+    EXPECT_TRUE(reply.json["error"]["errors"]["reason"].isString()) << c.what;
+  }
+  httplib::Client client("127.0.0.1", host_->port());
+  EXPECT_EQ(client.Post(kEntry, "{}", "application/json")->status, 415);
+  EXPECT_TRUE(Call(kSetting, "get", {}, sid).json["success"].asBool());  // still serving
+}
+
+}  // namespace

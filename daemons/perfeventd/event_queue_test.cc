@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include "kova/log.h"
+#include "perfeventd/test_support.h"
 #include "src/test_root.h"
 
 namespace perfeventd {

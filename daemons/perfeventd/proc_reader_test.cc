@@ -4,7 +4,7 @@
 
 #include "kova/perfevent.h"
 #include "perfeventd/measurements.h"
-#include "perfeventd/test_snapshot.h"
+#include "perfeventd/test_support.h"
 #include "src/test_root.h"
 
 namespace perfeventd {

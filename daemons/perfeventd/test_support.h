@@ -1,14 +1,19 @@
-// Writes recorded /proc files into a directory, for tests and benchmarks.
+// For tests and benchmarks: recorded /proc files written into a directory,
+// and the performance-event log read back.
 
-#ifndef KOVA_DAEMONS_PERFEVENTD_TEST_SNAPSHOT_H_
-#define KOVA_DAEMONS_PERFEVENTD_TEST_SNAPSHOT_H_
+#ifndef KOVA_DAEMONS_PERFEVENTD_TEST_SUPPORT_H_
+#define KOVA_DAEMONS_PERFEVENTD_TEST_SUPPORT_H_
 
 #include <sys/types.h>
 
 #include <cstdint>
 #include <filesystem>
 #include <fstream>
+#include <sstream>
 #include <string>
+#include <vector>
+
+#include "kova/log.h"
 
 namespace perfeventd {
 
@@ -46,6 +51,16 @@ inline void WriteSystem(const std::string& dir, uint64_t busy, uint64_t total,
                                   std::to_string(memory_available_kib) + " kB\n");
 }
 
+// The performance-event log's records as KOVALogGet1 prints them, without
+// their ids, fetched through the file `scratch`.
+inline std::vector<std::string> LogLines(const std::string& scratch) {
+  std::vector<std::string> lines;
+  if (KOVALogGet1(kLogTypePerfEvent, scratch.c_str(), "enu") != 0) return {"(no log)"};
+  std::ifstream in(scratch);
+  for (std::string line; std::getline(in, line);) lines.push_back(line.substr(line.find('\t') + 1));
+  return lines;
+}
+
 }  // namespace perfeventd
 
-#endif  // KOVA_DAEMONS_PERFEVENTD_TEST_SNAPSHOT_H_
+#endif  // KOVA_DAEMONS_PERFEVENTD_TEST_SUPPORT_H_

@@ -17,7 +17,9 @@ namespace {
 
 // Reads at most size - 1 bytes of the file `path` (relative to `dir_fd`) into
 // `buffer`, NUL-terminated. The length read, or -1 when it can't be read.
-ssize_t ReadSmall(int dir_fd, const char* path, char* buffer, size_t size) {
+// With `one_read`, for a file that the kernel hands out whole in one read (a
+// process's stat), a single read is made: a quarter fewer calls per process.
+ssize_t ReadSmall(int dir_fd, const char* path, char* buffer, size_t size, bool one_read = false) {
   const int fd = openat(dir_fd, path, O_RDONLY | O_CLOEXEC);
   if (fd < 0) return -1;
   size_t used = 0;
@@ -30,6 +32,7 @@ ssize_t ReadSmall(int dir_fd, const char* path, char* buffer, size_t size) {
     }
     if (got == 0) break;
     used += static_cast<size_t>(got);
+    if (one_read) break;
   }
   close(fd);
   buffer[used] = '\0';
@@ -188,7 +191,7 @@ void ProcReader::ReadProcesses(Snapshot& snapshot) const {
     memcpy(path + length, "/stat", sizeof("/stat"));
     ProcessSample sample;
     // A process that ends during the pass is simply left out.
-    if (ReadSmall(fd, path, text, sizeof(text)) > 0 && ParseProcessStat(text, sample)) {
+    if (ReadSmall(fd, path, text, sizeof(text), true) > 0 && ParseProcessStat(text, sample)) {
       snapshot.processes.push_back(sample);
     }
   }

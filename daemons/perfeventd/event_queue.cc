@@ -72,6 +72,10 @@ void EventQueue::Add(const std::vector<Event>& events) {
 
 bool EventQueue::Flush() {
   if (events_.empty()) return true;
+  // Kept in the file before the write, so that even a kill during the write
+  // loses nothing; a crash after the write but before the file is removed
+  // writes them twice rather than never.
+  Spill();
   std::vector<kova::LogRecord> records;
   records.reserve(events_.size());
   for (const Event& event : events_) {
@@ -99,7 +103,6 @@ bool EventQueue::Flush() {
     notify_(LOG_ERR, "can't write the performance-event log; its events wait and are retried");
   }
   failing_ = true;
-  Spill();
   return false;
 }
 

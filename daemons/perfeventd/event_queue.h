@@ -1,8 +1,9 @@
 // The events decided and not yet in the performance-event log.
 //
-// A write that fails keeps the events, in order, for the next try. While any
-// wait they are also kept in a file, so that a stop or a crash loses none: the
-// next start reads them back. Each event keeps the time it was decided.
+// A write that fails keeps the events, in order, for the next try. Until they
+// are in the log they are also kept in a file, so that a stop or a crash loses
+// none: the next start reads them back. Each event keeps the time it was
+// decided.
 
 #ifndef KOVA_DAEMONS_PERFEVENTD_EVENT_QUEUE_H_
 #define KOVA_DAEMONS_PERFEVENTD_EVENT_QUEUE_H_
@@ -32,7 +33,7 @@ class EventQueue {
   size_t size() const { return events_.size(); }
 
  private:
-  // Keeps the waiting events in the file, when they changed since last kept.
+  // Keeps the waiting events in the file when they changed since last kept.
   void Spill();
 
   std::string spill_path_;

@@ -30,14 +30,14 @@ Monitor::Monitor(ObjectDirectory& directory, Notify notify)
     : directory_(directory), notify_(std::move(notify)) {}
 
 void Monitor::SetRules(const std::vector<Rule>& rules) {
+  std::unordered_map<std::string, size_t> old_index;
+  for (size_t i = 0; i < states_.size(); ++i) old_index.emplace(states_[i].rule.id, i);
   std::vector<RuleState> states;
   states.reserve(rules.size());
   int cycle = 0;
   for (const Rule& rule : rules) {
-    auto kept = states_.end();
-    for (auto it = states_.begin(); it != states_.end(); ++it) {
-      if (it->rule.id == rule.id) kept = it;
-    }
+    const auto found = old_index.find(rule.id);
+    const auto kept = found != old_index.end() ? states_.begin() + found->second : states_.end();
     if (kept != states_.end() && kept->rule == rule) {
       states.push_back(std::move(*kept));
     } else {

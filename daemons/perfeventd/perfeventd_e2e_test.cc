@@ -3,7 +3,7 @@
 // KOVA.ResourceMonitor.so (loaded with dlopen over libkova.so): rules made with
 // "EventRule" "set", the daemon started with "Setting" "set", the events found
 // with "Log" "list". The daemon runs with a time scale, so a 30 s window takes
-// well under a second.
+// well under a second, on recorded /proc files or on the live /proc.
 
 #include <dlfcn.h>
 #include <gmock/gmock.h>
@@ -16,6 +16,7 @@
 
 #include "fake/host_call.h"
 #include "fake/run_in_child.h"
+#include "kova/perfevent.h"
 #include "kova/service.h"
 #include "kova/webapi.h"
 #include "perfeventd/test_support.h"
@@ -24,7 +25,9 @@
 namespace perfeventd {
 namespace {
 
+using ::testing::Contains;
 using ::testing::ElementsAre;
+using ::testing::HasSubstr;
 
 class PerfEventE2eTest : public ::testing::Test {
  protected:
@@ -38,9 +41,10 @@ class PerfEventE2eTest : public ::testing::Test {
     for (const char* service : {"kovaperfeventd", "burner"}) QLIBServiceStop(service, 0);
   }
 
-  void InstallDaemon(const std::string& options) {
-    const std::string command = std::string(KOVA_INSTALL_SERVICE) + " " + root_.path() + " " +
-                                KOVAPERFEVENTD_PATH + " " + options;
+  // Installs the service running `command` (the daemon by default).
+  void InstallDaemon(const std::string& command_line) {
+    const std::string command =
+        std::string(KOVA_INSTALL_SERVICE) + " " + root_.path() + " " + command_line;
     ASSERT_EQ(system(command.c_str()), 0);
   }
 
@@ -80,8 +84,8 @@ class PerfEventE2eTest : public ::testing::Test {
               KOVA::APIResponse::State::kSuccess);
   }
 
-  // The event texts that "Log" "list" answers for `level`, once there are at
-  // least `count` of them or after `seconds`.
+  // The entries "<level>: <text>" that "Log" "list" answers for `level` (""
+  // for all), once there are at least `count` of them or after `seconds`.
   std::vector<std::string> Events(const char* level, size_t count, int seconds = 5) {
     std::vector<std::string> texts;
     for (int i = 0; i < seconds * 50 && texts.size() < count; ++i) {
@@ -90,7 +94,9 @@ class PerfEventE2eTest : public ::testing::Test {
                                     std::string(R"({"filter": {"loglevel": ")") + level + "\"}}")
                                    .GetData()["logs"];
       texts.clear();
-      for (const Json::Value& entry : logs) texts.push_back(entry["event"].asString());
+      for (const Json::Value& entry : logs) {
+        texts.push_back(entry["level"].asString() + ": " + entry["event"].asString());
+      }
     }
     return texts;
   }
@@ -99,7 +105,7 @@ class PerfEventE2eTest : public ::testing::Test {
   APITableEntry* table_ = nullptr;
 };
 
-TEST_F(PerfEventE2eTest, RecordedProcRaisesEventsOfEachSeverity) {
+TEST_F(PerfEventE2eTest, RecordedProcRaisesReloadsRecoversAndEndsCleanly) {
   // Memory 80% in use; the service "websrv" is process 4242 with a child, 30% together.
   const std::string proc = root_.Path("/snapshot/proc");
   WriteSystem(proc, 100, 1000, 1000000, 200000);
@@ -110,24 +116,52 @@ TEST_F(PerfEventE2eTest, RecordedProcRaisesEventsOfEachSeverity) {
   root_.Write("/run/kova/websrv.pid", "4242 777\n");
   root_.Write("/etc/kova/services/websrv.conf",
               "command=\"/bin/sleep 300\"\ndisplay_name=\"Web server\"\n");
-  InstallDaemon("--proc " + proc + " --time-scale 0.01");
+  // The daemon's system-log lines go to a file.
+  InstallDaemon("/bin/sh -c \"exec " KOVAPERFEVENTD_PATH " --proc " + proc +
+                " --time-scale 0.01 --log-stderr 2>>" + root_.Path("/daemon.err") + "\"");
   EXPECT_TRUE(AsHost([&] {
+    EnableEvents(true);
+    // Rules made while the daemon runs reach it by the reload signal.
     SetRule(R"({"service": "", "type": 0, "resource": 2, "severity": 1, "threshold": 75,
                 "enable": true})");
     SetRule(R"({"service": "websrv", "type": 1, "resource": 2, "severity": 2, "threshold": 29,
                 "enable": true})");
-    SetRule(R"({"service": "websrv", "type": 1, "resource": 2, "severity": 1, "threshold": 31,
-                "enable": true})");  // never above
-    EnableEvents(true);
     EXPECT_THAT(Events("Warning", 1),
-                ElementsAre("Memory use of the system has been above 75% for 30 seconds "
+                ElementsAre("Warning: Memory use of the system has been above 75% for 30 seconds "
                             "(average 80.0%)."));
-    EXPECT_THAT(Events("Critical", 1),
-                ElementsAre("Memory use of service \"Web server\" has been above 29% for 30 "
-                            "seconds (average 30.0%)."));
-    EnableEvents(false);
-    EXPECT_EQ(QLIBServiceIsRunning("kovaperfeventd"), 0);
+    EXPECT_THAT(
+        Events("Critical", 1),
+        ElementsAre("Critical: Memory use of service \"Web server\" has been above 29% for 30 "
+                    "seconds (average 30.0%)."));
+    // A rule stored without a signal is found all the same.
+    KOVAPERFEVENT_CONF_SETTING rule{};
+    rule = {{}, PERFEVENT_TYPE_SYSTEM, "NAS", PERFEVENT_RESOURCE_MEMORY, 1, 60, 5, 30, 1};
+    ASSERT_EQ(KOVAPerfEventConfAdd(&rule), 0);
+    EXPECT_EQ(Events("Warning", 2).size(), 2u);
   }));
+  // meminfo can't be read for a while, then the memory goes down.
+  std::filesystem::rename(proc + "/meminfo", proc + "/meminfo.away");
+  std::this_thread::sleep_for(std::chrono::milliseconds(300));
+  WriteSystem(proc, 100, 1000, 1000000, 900000);
+  EXPECT_TRUE(AsHost([&] {
+    const std::vector<std::string> all = Events("", 5);
+    EXPECT_THAT(all, Contains(HasSubstr("Info: Memory use of the system has been back at or "
+                                        "below 75% for 30 seconds (average 10.0%).")));
+    EXPECT_THAT(all, Contains(HasSubstr("Info: Memory use of the system \"NAS\" has been back")));
+    EXPECT_EQ(all.size(), 5u);  // the service's memory stays high
+    EnableEvents(false);
+  }));
+  std::vector<std::string> lines;
+  std::istringstream err(root_.Read("/daemon.err"));
+  for (std::string line; std::getline(err, line);) lines.push_back(line.substr(line.find(' ') + 1));
+  EXPECT_EQ(std::count(lines.begin(), lines.end(), "can't read " + proc + "/meminfo"), 1);
+  EXPECT_EQ(std::count_if(lines.begin(), lines.end(),
+                          [](const std::string& line) {
+                            return line.find(") is skipped: the memory counters") !=
+                                   std::string::npos;
+                          }),
+            3);                        // once for each rule on the system's memory, not every cycle
+  EXPECT_EQ(lines.back(), "stopped");  // SIGTERM ended it cleanly
 }
 
 TEST_F(PerfEventE2eTest, AServiceThatBurnsCpuRaisesAWarning) {
@@ -135,7 +169,7 @@ TEST_F(PerfEventE2eTest, AServiceThatBurnsCpuRaisesAWarning) {
               "command=\"/bin/sh -c \"while :; do :; done\"\"\ndisplay_name=\"Burner\"\n");
   // The live /proc, a cycle every 250 ms: enough clock ticks for a share of
   // the CPU to show, even on a busy machine.
-  InstallDaemon("--time-scale 0.05");
+  InstallDaemon(KOVAPERFEVENTD_PATH " --time-scale 0.05");
   ASSERT_EQ(QLIBServiceStart("burner", 0), 0);
   EXPECT_TRUE(AsHost([&] {
     EnableEvents(true);
@@ -144,7 +178,8 @@ TEST_F(PerfEventE2eTest, AServiceThatBurnsCpuRaisesAWarning) {
                 "enable": true})");
     const std::vector<std::string> events = Events("Warning", 1, 15);
     ASSERT_EQ(events.size(), 1u);
-    EXPECT_EQ(events[0].rfind("CPU use of service \"Burner\" has been above 2% for 30 seconds", 0),
+    EXPECT_EQ(events[0].rfind(
+                  "Warning: CPU use of service \"Burner\" has been above 2% for 30 seconds", 0),
               0u)
         << events[0];
   }));

@@ -27,6 +27,8 @@ struct ProcessSample {
   uint64_t start_time = 0;  // clock ticks since boot
   uint64_t ticks = 0;       // user and system time, clock ticks
   uint64_t rss_pages = 0;
+
+  bool operator==(const ProcessSample&) const = default;
 };
 
 // A line of diskstats.
@@ -38,6 +40,8 @@ struct DiskSample {
   uint64_t sectors = 0;     // 512-byte sectors read and written
   uint64_t io_ms = 0;       // milliseconds spent reading and writing
   bool whole_disk = false;  // a physical disk, not a partition or a virtual device
+
+  bool operator==(const DiskSample&) const = default;
 };
 
 // A line of self/mountinfo: the device mounted at `path`.

@@ -56,6 +56,10 @@ void EventQueue::Restore() {
       events.push_back(std::move(event));
     }
   }
+  if (!events.empty()) {
+    notify_(LOG_INFO,
+            std::to_string(events.size()) + " events of an earlier run wait to be written");
+  }
   Add(events);
 }
 

@@ -33,6 +33,8 @@ void Measurements::Advance(Snapshot now) {
   const std::vector<ProcessSample>& processes = current_.processes;
   const size_t count = processes.size();
   first_child_.assign(count, -1);
+  seen_.assign(count, 0);
+  generation_ = 0;
   next_sibling_.assign(count, -1);
   // Children in reverse, so that each list comes out in pid order.
   for (size_t i = count; i-- > 0;) {
@@ -117,12 +119,19 @@ Measured Measurements::Processes(pid_t pid, uint64_t start_time, int32_t resourc
   if (cpu && !current_.cpu) return Problem(kNoCpu);
   if (!cpu && current_.memory_total_kib == 0) return Problem(kNoMemory);
   if (cpu && (!deltas_ || !previous_.cpu || previous_.cpu->total > current_.cpu->total)) return {};
-  // The process and its descendants, depth first.
+  // The process and its descendants, depth first, each once: in a broken
+  // recording parents may go round in a circle.
+  if (++generation_ == 0) {  // wrapped round: the marks start afresh
+    std::fill(seen_.begin(), seen_.end(), 0);
+    generation_ = 1;
+  }
   uint64_t sum = 0;
   std::vector<int> stack = {root};
   while (!stack.empty()) {
     const int at = stack.back();
     stack.pop_back();
+    if (seen_[at] == generation_) continue;
+    seen_[at] = generation_;
     sum += cpu ? delta_ticks_[at] : current_.processes[at].rss_pages;
     for (int child = first_child_[at]; child >= 0; child = next_sibling_[child]) {
       stack.push_back(child);

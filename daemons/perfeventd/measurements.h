@@ -70,6 +70,9 @@ class Measurements {
   std::vector<uint64_t> delta_ticks_;  // per process of the current pass
   std::vector<int> first_child_;       // per process: its first child's index, or -1
   std::vector<int> next_sibling_;      // per process: the next child of its parent, or -1
+  // Per process: the walk that last counted it, so that a walk counts each once.
+  mutable std::vector<uint32_t> seen_;
+  mutable uint32_t generation_ = 0;
 };
 
 }  // namespace perfeventd

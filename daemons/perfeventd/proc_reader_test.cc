@@ -106,6 +106,12 @@ TEST(MeasurementsTest, MeasuresServicesSystemAndDisksBetweenTwoPasses) {
   EXPECT_DOUBLE_EQ(ValueOf(m.System(PERFEVENT_RESOURCE_IO_LATENCY)), 10);
   EXPECT_EQ(ValueOf(m.Device(9, 0, PERFEVENT_RESOURCE_IO_RATE)), -2);
 
+  // Parents that go round in a circle (a broken recording) end the walk.
+  Snapshot circle = now;
+  circle.processes[0].ppid = 12;
+  m.Advance(circle);
+  EXPECT_DOUBLE_EQ(ValueOf(m.Processes(10, 50, PERFEVENT_RESOURCE_MEMORY)), 20);
+
   // Counters that went back (a replaced device) give no reading.
   Snapshot later = now;
   later.disks[0].sectors = 0;

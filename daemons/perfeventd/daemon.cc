@@ -33,6 +33,13 @@ double Now() {
 
 void Log(int priority, const std::string& text) { syslog(priority, "%s", text.c_str()); }
 
+sigset_t HeldSignals() {
+  sigset_t signals;
+  sigemptyset(&signals);
+  for (int number : {SIGTERM, SIGINT, SIGHUP}) sigaddset(&signals, number);
+  return signals;
+}
+
 // The loop's state between cycles.
 class Daemon {
  public:
@@ -44,10 +51,8 @@ class Daemon {
         queue_(kova::RootPath(kSpillPath), kQueueCapacity, Log) {}
 
   int Run() {
-    sigset_t signals;
-    sigemptyset(&signals);
-    for (int number : {SIGTERM, SIGINT, SIGHUP}) sigaddset(&signals, number);
     // The signals are taken synchronously, between cycles.
+    const sigset_t signals = HeldSignals();
     sigprocmask(SIG_BLOCK, &signals, nullptr);
     signal(SIGPIPE, SIG_IGN);
     Log(LOG_INFO, "started");
@@ -121,6 +126,11 @@ class Daemon {
 };
 
 }  // namespace
+
+void BlockSignals() {
+  const sigset_t signals = HeldSignals();
+  sigprocmask(SIG_BLOCK, &signals, nullptr);
+}
 
 int RunDaemon(const Options& options) {
   openlog("kovaperfeventd", LOG_PID | (options.log_to_stderr ? LOG_PERROR : 0), LOG_DAEMON);

@@ -8,6 +8,9 @@
 
 namespace perfeventd {
 
+// Holds SIGTERM, SIGINT and SIGHUP back for RunDaemon to take.
+void BlockSignals();
+
 // Runs until SIGTERM or SIGINT; returns the exit status.
 int RunDaemon(const Options& options);
 

@@ -7,6 +7,9 @@
 #include "perfeventd/options.h"
 
 int main(int argc, char** argv) {
+  // The reload and stop signals wait for the main loop from the start: a
+  // reload asked for while the program starts must not end it.
+  perfeventd::BlockSignals();
   perfeventd::Options options;
   std::string error;
   if (!perfeventd::ParseOptions(argc, argv, options, error)) {

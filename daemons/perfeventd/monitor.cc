@@ -2,9 +2,9 @@
 
 #include <syslog.h>
 
-#include <algorithm>
 #include <numeric>
 #include <unordered_map>
+#include <unordered_set>
 
 #include "kova/perfevent.h"
 
@@ -48,17 +48,19 @@ void Monitor::SetRules(const std::vector<Rule>& rules) {
       states.push_back(std::move(state));
     }
     RuleState& state = states.back();
-    Say(state, state.fixed_problem);
-    if (state.fixed_problem.empty()) cycle = std::gcd(cycle, rule.period);
+    if (state.fixed_problem.empty()) {
+      cycle = std::gcd(cycle, rule.period);
+    } else {
+      Say(state, state.fixed_problem);
+    }
   }
   states_ = std::move(states);
   // Forget the processes of services that no rule watches any more.
-  for (auto it = processes_.begin(); it != processes_.end();) {
-    const bool watched = std::any_of(states_.begin(), states_.end(), [&](const RuleState& state) {
-      return state.rule.type == PERFEVENT_TYPE_SERVICE && state.rule.object == it->first;
-    });
-    it = watched ? std::next(it) : processes_.erase(it);
+  std::unordered_set<std::string> watched;
+  for (const RuleState& state : states_) {
+    if (state.rule.type == PERFEVENT_TYPE_SERVICE) watched.insert(state.rule.object);
   }
+  std::erase_if(processes_, [&](const auto& entry) { return !watched.count(entry.first); });
   cycle_seconds_ = cycle > 0 ? cycle : kDefaultCycleSeconds;
   for (RuleState& state : states_) {
     const int per_sample = state.rule.period / cycle_seconds_;

@@ -109,12 +109,16 @@ TEST_F(MonitorTest, SwitchingOrChangingARuleStartsAFreshWindow) {
 }
 
 TEST_F(MonitorTest, AProblemIsSaidOnceUntilTheRuleIsMeasuredAgain) {
-  monitor_->SetRules({MakeRule("1", 1, "smb", PERFEVENT_RESOURCE_MEMORY, 1, 50),
-                      MakeRule("2", 1, "smb", PERFEVENT_RESOURCE_CPU, 1, 50),
-                      MakeRule("3", 2, "gone", PERFEVENT_RESOURCE_IO_RATE, 1, 50),
-                      MakeRule("4", 1, "smb", PERFEVENT_RESOURCE_IO_RATE, 1, 50)});
+  const std::vector<Rule> rules = {MakeRule("1", 1, "smb", PERFEVENT_RESOURCE_MEMORY, 1, 50),
+                                   MakeRule("2", 1, "smb", PERFEVENT_RESOURCE_CPU, 1, 50),
+                                   MakeRule("3", 2, "gone", PERFEVENT_RESOURCE_IO_RATE, 1, 50),
+                                   MakeRule("4", 1, "smb", PERFEVENT_RESOURCE_IO_RATE, 1, 50)};
+  monitor_->SetRules(rules);
   EXPECT_TRUE(monitor_->Needs().processes && monitor_->Needs().mounts);
-  for (int i = 0; i < 3; ++i) EXPECT_THAT(Cycle(80), ElementsAre());
+  for (int i = 0; i < 3; ++i) {
+    EXPECT_THAT(Cycle(80), ElementsAre());
+    monitor_->SetRules(rules);  // a reload says nothing again
+  }
   directory_.services["smb"] = {10, 50};
   Cycle(80);
   EXPECT_THAT(Cycle(80), ElementsAre("Warning Memory use of service \"N-smb\" has been above 50%"));

@@ -12,6 +12,7 @@
 
 #include <chrono>
 #include <filesystem>
+#include <sstream>
 #include <thread>
 
 #include "fake/host_call.h"
@@ -41,11 +42,33 @@ class PerfEventE2eTest : public ::testing::Test {
     for (const char* service : {"kovaperfeventd", "burner"}) QLIBServiceStop(service, 0);
   }
 
-  // Installs the service running `command` (the daemon by default).
-  void InstallDaemon(const std::string& command_line) {
-    const std::string command =
-        std::string(KOVA_INSTALL_SERVICE) + " " + root_.path() + " " + command_line;
+  // Installs the service: the daemon with `options`, its system-log lines
+  // into /daemon.err.
+  void InstallDaemon(const std::string& options) {
+    const std::string command = std::string(KOVA_INSTALL_SERVICE) + " " + root_.path() +
+                                " /bin/sh -c \"exec " KOVAPERFEVENTD_PATH " " + options +
+                                " --log-stderr 2>>" + root_.Path("/daemon.err") + "\"";
     ASSERT_EQ(system(command.c_str()), 0);
+  }
+
+  // The daemon's system-log lines, without the "kovaperfeventd[pid]: ".
+  std::vector<std::string> DaemonLog() {
+    std::vector<std::string> lines;
+    std::istringstream err(root_.Read("/daemon.err"));
+    for (std::string line; std::getline(err, line);) {
+      lines.push_back(line.substr(line.find(' ') + 1));
+    }
+    return lines;
+  }
+
+  // Turns events on and waits until the daemon has read its rules: the
+  // platform's start returns when the program runs, before it takes signals.
+  void StartDaemon() {
+    EnableEvents(true);
+    for (int i = 0; i < 250 && DaemonLog().size() < 2; ++i) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+    ASSERT_THAT(DaemonLog(), Contains(HasSubstr("enabled rules")));
   }
 
   // Runs `body` in a child with the host's ids (unprivileged, saved ids 0),
@@ -116,11 +139,9 @@ TEST_F(PerfEventE2eTest, RecordedProcRaisesReloadsRecoversAndEndsCleanly) {
   root_.Write("/run/kova/websrv.pid", "4242 777\n");
   root_.Write("/etc/kova/services/websrv.conf",
               "command=\"/bin/sleep 300\"\ndisplay_name=\"Web server\"\n");
-  // The daemon's system-log lines go to a file.
-  InstallDaemon("/bin/sh -c \"exec " KOVAPERFEVENTD_PATH " --proc " + proc +
-                " --time-scale 0.01 --log-stderr 2>>" + root_.Path("/daemon.err") + "\"");
+  InstallDaemon("--proc " + proc + " --time-scale 0.01");
   EXPECT_TRUE(AsHost([&] {
-    EnableEvents(true);
+    StartDaemon();
     // Rules made while the daemon runs reach it by the reload signal.
     SetRule(R"({"service": "", "type": 0, "resource": 2, "severity": 1, "threshold": 75,
                 "enable": true})");
@@ -151,9 +172,8 @@ TEST_F(PerfEventE2eTest, RecordedProcRaisesReloadsRecoversAndEndsCleanly) {
     EXPECT_EQ(all.size(), 5u);  // the service's memory stays high
     EnableEvents(false);
   }));
-  std::vector<std::string> lines;
-  std::istringstream err(root_.Read("/daemon.err"));
-  for (std::string line; std::getline(err, line);) lines.push_back(line.substr(line.find(' ') + 1));
+  const std::vector<std::string> lines = DaemonLog();
+  ASSERT_FALSE(lines.empty());
   EXPECT_EQ(std::count(lines.begin(), lines.end(), "can't read " + proc + "/meminfo"), 1);
   EXPECT_EQ(std::count_if(lines.begin(), lines.end(),
                           [](const std::string& line) {
@@ -169,10 +189,10 @@ TEST_F(PerfEventE2eTest, AServiceThatBurnsCpuRaisesAWarning) {
               "command=\"/bin/sh -c \"while :; do :; done\"\"\ndisplay_name=\"Burner\"\n");
   // The live /proc, a cycle every 250 ms: enough clock ticks for a share of
   // the CPU to show, even on a busy machine.
-  InstallDaemon(KOVAPERFEVENTD_PATH " --time-scale 0.05");
+  InstallDaemon("--time-scale 0.05");
   ASSERT_EQ(QLIBServiceStart("burner", 0), 0);
   EXPECT_TRUE(AsHost([&] {
-    EnableEvents(true);
+    StartDaemon();
     // A rule made while the daemon runs reaches it by the reload signal.
     SetRule(R"({"service": "burner", "type": 1, "resource": 1, "severity": 1, "threshold": 2,
                 "enable": true})");

@@ -1,0 +1,36 @@
+// The performance-event log's entries: level and plain English text of a
+// rule's change.
+
+#ifndef KOVA_DAEMONS_PERFEVENTD_EVENT_TEXT_H_
+#define KOVA_DAEMONS_PERFEVENTD_EVENT_TEXT_H_
+
+#include <cstdint>
+#include <string>
+
+#include "perfeventd/rule.h"
+
+namespace perfeventd {
+
+// One entry to write into the performance-event log.
+struct Event {
+  int64_t time = 0;   // seconds since the epoch, when it was decided
+  std::string level;  // "Warning", "Critical" or "Info"
+  std::string text;
+
+  bool operator==(const Event&) const = default;
+};
+
+// What a rule watches, as texts name it: `CPU use of service "Web server"`.
+std::string RuleSubject(const Rule& rule, const std::string& object_name);
+
+// The entry for a rule that has been above its threshold for a whole window
+// (`raised`) or back at or below it for a whole window (not `raised`), with
+// `average` the mean of the window's samples and `object_name` the display
+// name of the rule's object. A raise is logged at the rule's severity, a
+// recovery at "Info".
+Event DescribeChange(const Rule& rule, const std::string& object_name, bool raised, double average,
+                     int64_t time);
+
+}  // namespace perfeventd
+
+#endif  // KOVA_DAEMONS_PERFEVENTD_EVENT_TEXT_H_

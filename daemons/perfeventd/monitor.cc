@@ -1,0 +1,186 @@
+#include "perfeventd/monitor.h"
+
+#include <syslog.h>
+
+#include <numeric>
+#include <unordered_map>
+#include <unordered_set>
+
+#include "kova/perfevent.h"
+
+namespace perfeventd {
+namespace {
+
+constexpr int kDefaultCycleSeconds = 5;
+
+bool IsIo(int32_t resource) {
+  return resource == PERFEVENT_RESOURCE_IO_RATE || resource == PERFEVENT_RESOURCE_IO_LATENCY;
+}
+
+// Whether `path` is `mount` or lies below it.
+bool IsUnder(const std::string& path, const std::string& mount) {
+  if (mount == "/") return !path.empty() && path[0] == '/';
+  return path.compare(0, mount.size(), mount) == 0 &&
+         (path.size() == mount.size() || path[mount.size()] == '/');
+}
+
+}  // namespace
+
+Monitor::Monitor(ObjectDirectory& directory, Notify notify)
+    : directory_(directory), notify_(std::move(notify)) {}
+
+void Monitor::SetRules(const std::vector<Rule>& rules) {
+  std::unordered_map<std::string, size_t> old_index;
+  for (size_t i = 0; i < states_.size(); ++i) old_index.emplace(states_[i].rule.id, i);
+  std::vector<RuleState> states;
+  states.reserve(rules.size());
+  int cycle = 0;
+  for (const Rule& rule : rules) {
+    const auto found = old_index.find(rule.id);
+    const auto kept = found != old_index.end() ? states_.begin() + found->second : states_.end();
+    if (kept != states_.end() && kept->rule == rule) {
+      states.push_back(std::move(*kept));
+    } else {
+      RuleState state(rule);
+      state.key =
+          std::to_string(rule.type) + '/' + std::to_string(rule.resource) + '/' + rule.object;
+      if (kept != states_.end()) state.said = kept->said;
+      states.push_back(std::move(state));
+    }
+    RuleState& state = states.back();
+    if (state.fixed_problem.empty()) {
+      cycle = std::gcd(cycle, rule.period);
+    } else {
+      Say(state, state.fixed_problem);
+    }
+  }
+  states_ = std::move(states);
+  // Forget the processes of services that no rule watches any more.
+  std::unordered_set<std::string> watched;
+  for (const RuleState& state : states_) {
+    if (state.rule.type == PERFEVENT_TYPE_SERVICE) watched.insert(state.rule.object);
+  }
+  std::erase_if(processes_, [&](const auto& entry) { return !watched.count(entry.first); });
+  cycle_seconds_ = cycle > 0 ? cycle : kDefaultCycleSeconds;
+  for (RuleState& state : states_) {
+    const int per_sample = state.rule.period / cycle_seconds_;
+    if (per_sample != state.cycles_per_sample) {
+      // The cycle changed under a sample being gathered: gather it anew.
+      state.cycles_per_sample = per_sample > 0 ? per_sample : 1;
+      state.cycles = 0;
+      state.sum = Reading{};
+      state.missing = false;
+    }
+  }
+}
+
+SampleNeeds Monitor::Needs() const {
+  SampleNeeds needs;
+  for (const RuleState& state : states_) {
+    if (!state.fixed_problem.empty()) continue;
+    const int32_t type = state.rule.type;
+    const bool io = IsIo(state.rule.resource);
+    needs.processes |= type == PERFEVENT_TYPE_SERVICE;
+    needs.disks |= io;
+    needs.mounts |= type == PERFEVENT_TYPE_ISCSI_LUN;
+    needs.whole_disks |= io && type == PERFEVENT_TYPE_SYSTEM;
+  }
+  return needs;
+}
+
+std::vector<Event> Monitor::Cycle(const Measurements& measurements, int64_t now) {
+  directory_.Refresh();
+  std::vector<Event> events;
+  // Rules on one object and resource share one measurement.
+  std::unordered_map<std::string, Measured> measured;
+  for (RuleState& state : states_) {
+    if (!state.fixed_problem.empty()) continue;
+    auto found = measured.find(state.key);
+    if (found == measured.end()) {
+      found = measured.emplace(state.key, Measure(state.rule, measurements)).first;
+    }
+    const Measured& result = found->second;
+    if (result.reading) {
+      Say(state, "");
+      state.sum += *result.reading;
+    } else {
+      if (!result.problem.empty()) Say(state, result.problem);
+      state.missing = true;
+    }
+    if (++state.cycles < state.cycles_per_sample) continue;
+    const std::optional<double> sample =
+        state.missing ? std::nullopt : std::optional<double>(state.sum.value());
+    state.cycles = 0;
+    state.sum = Reading{};
+    state.missing = false;
+    const RuleWindow::Change change = state.window.Feed(sample);
+    if (change == RuleWindow::Change::kNone) continue;
+    events.push_back(
+        DescribeChange(state.rule, directory_.DisplayName(state.rule.type, state.rule.object),
+                       change == RuleWindow::Change::kRaised, state.window.average(), now));
+  }
+  return events;
+}
+
+Measured Monitor::Measure(const Rule& rule, const Measurements& measurements) {
+  switch (rule.type) {
+    case PERFEVENT_TYPE_SERVICE:
+      return MeasureService(rule.object, rule.resource, measurements);
+    case PERFEVENT_TYPE_ISCSI_LUN:
+      return MeasureLun(rule.object, rule.resource, measurements);
+    default:
+      return measurements.System(rule.resource);
+  }
+}
+
+Measured Monitor::MeasureService(const std::string& name, int32_t resource,
+                                 const Measurements& measurements) {
+  auto known = processes_.find(name);
+  // The record is read again only when the process last known is gone.
+  if (known == processes_.end() ||
+      !measurements.HasProcess(known->second.pid, known->second.start_time)) {
+    const std::optional<RecordedProcess> recorded = directory_.ServiceProcess(name);
+    if (!recorded) {
+      if (known != processes_.end()) processes_.erase(known);
+      return Measured{std::nullopt, "the service is not running"};
+    }
+    known = processes_.insert_or_assign(name, *recorded).first;
+  }
+  Measured result = measurements.Processes(known->second.pid, known->second.start_time, resource);
+  if (result.problem == "its process is gone") result.problem = "the service is not running";
+  return result;
+}
+
+Measured Monitor::MeasureLun(const std::string& uuid, int32_t resource,
+                             const Measurements& measurements) {
+  const std::optional<std::string> volume = directory_.LunVolume(uuid);
+  if (!volume) return Measured{std::nullopt, "no LUN has this uuid"};
+  if (volume->empty()) return Measured{std::nullopt, "the LUN names no volume"};
+  const Snapshot& snapshot = measurements.current();
+  if (!snapshot.mounts_read) return Measured{std::nullopt, "the mounts can't be read"};
+  // The device of the deepest mount that holds the volume.
+  const std::string path = directory_.RealPath(*volume);
+  const MountPoint* holder = nullptr;
+  for (const MountPoint& mount : snapshot.mounts) {
+    if (IsUnder(path, mount.path) &&
+        (holder == nullptr || mount.path.size() >= holder->path.size())) {
+      holder = &mount;
+    }
+  }
+  if (holder == nullptr) return Measured{std::nullopt, "no mount holds its volume " + *volume};
+  return measurements.Device(holder->major, holder->minor, resource);
+}
+
+void Monitor::Say(RuleState& state, const std::string& problem) {
+  if (problem == state.said) return;
+  const std::string subject =
+      "rule " + state.rule.id + " (" + RuleSubject(state.rule, state.rule.object) + ")";
+  if (problem.empty()) {
+    notify_(LOG_INFO, subject + " is measured again");
+  } else {
+    notify_(LOG_WARNING, subject + " is skipped: " + problem);
+  }
+  state.said = problem;
+}
+
+}  // namespace perfeventd

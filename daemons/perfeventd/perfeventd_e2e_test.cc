@@ -1,0 +1,209 @@
+// kovaperfeventd as the platform service "kovaperfeventd" in a temporary
+// system root, installed by install-service.sh and driven through the module
+// KOVA.ResourceMonitor.so (loaded with dlopen over libkova.so): rules made with
+// "EventRule" "set", the daemon started with "Setting" "set", the events found
+// with "Log" "list". The daemon runs with a time scale, so a 30 s window takes
+// well under a second, on recorded /proc files or on the live /proc.
+
+#include <dlfcn.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <filesystem>
+#include <sstream>
+#include <thread>
+
+#include "fake/host_call.h"
+#include "fake/run_in_child.h"
+#include "kova/perfevent.h"
+#include "kova/service.h"
+#include "kova/webapi.h"
+#include "perfeventd/test_support.h"
+#include "src/test_root.h"
+
+namespace perfeventd {
+namespace {
+
+using ::testing::Contains;
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+
+class PerfEventE2eTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    std::filesystem::create_directories(root_.Path("/usr/share/kova"));
+    std::filesystem::copy(KOVA_TEXTS_DIR, root_.Path("/usr/share/kova/texts"),
+                          std::filesystem::copy_options::recursive);
+    std::filesystem::create_directories(root_.Path("/run/kova"));
+  }
+  void TearDown() override {
+    for (const char* service : {"kovaperfeventd", "burner"}) QLIBServiceStop(service, 0);
+  }
+
+  // Installs the service: the daemon with `options`, its system-log lines
+  // into /daemon.err.
+  void InstallDaemon(const std::string& options) {
+    const std::string command = std::string(KOVA_INSTALL_SERVICE) + " " + root_.path() +
+                                " /bin/sh -c \"exec " KOVAPERFEVENTD_PATH " " + options +
+                                " --log-stderr 2>>" + root_.Path("/daemon.err") + "\"";
+    ASSERT_EQ(system(command.c_str()), 0);
+  }
+
+  // The daemon's system-log lines, without the "kovaperfeventd[pid]: ".
+  std::vector<std::string> DaemonLog() {
+    std::vector<std::string> lines;
+    std::istringstream err(root_.Read("/daemon.err"));
+    for (std::string line; std::getline(err, line);) {
+      lines.push_back(line.substr(line.find(' ') + 1));
+    }
+    return lines;
+  }
+
+  // Turns events on and waits until the daemon has read its rules: the
+  // platform's start returns when the program runs, before it takes signals.
+  void StartDaemon() {
+    EnableEvents(true);
+    for (int i = 0; i < 250 && DaemonLog().size() < 2; ++i) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+    ASSERT_THAT(DaemonLog(), Contains(HasSubstr("enabled rules")));
+  }
+
+  // Runs `body` in a child with the host's ids (unprivileged, saved ids 0),
+  // over the loaded module.
+  bool AsHost(const std::function<void()>& body) {
+    return kova_fake::RunInChild([&] {
+      ASSERT_EQ(setresgid(1000, 1000, 0), 0);
+      ASSERT_EQ(setresuid(1000, 1000, 0), 0);
+      void* module = dlopen(KOVA_MODULE_PATH, RTLD_NOW | RTLD_LOCAL);
+      ASSERT_NE(module, nullptr) << dlerror();
+      table_ = reinterpret_cast<GetAPITableFunc>(dlsym(module, kGetAPITableSymbol))();
+      body();
+    });
+  }
+
+  KOVA::APIResponse Call(const char* api, const char* method, const std::string& params) {
+    for (const APITableEntry* row = table_; row != nullptr && row->api != nullptr; ++row) {
+      if (std::string(row->api) == api && std::string(row->method) == method) {
+        return kova_fake::CallHandler(row->handler, params);
+      }
+    }
+    ADD_FAILURE() << api << " " << method << " not in the table";
+    return KOVA::APIResponse();
+  }
+
+  void SetRule(const std::string& rule) {
+    EXPECT_EQ(Call("KOVA.ResourceMonitor.EventRule", "set", rule).GetState(),
+              KOVA::APIResponse::State::kSuccess)
+        << rule;
+  }
+
+  void EnableEvents(bool on) {
+    EXPECT_EQ(Call("KOVA.ResourceMonitor.Setting", "set",
+                   on ? R"({"enable_event": true})" : R"({"enable_event": false})")
+                  .GetState(),
+              KOVA::APIResponse::State::kSuccess);
+  }
+
+  // The entries "<level>: <text>" that "Log" "list" answers for `level` (""
+  // for all), once there are at least `count` of them or after `seconds`.
+  std::vector<std::string> Events(const char* level, size_t count, int seconds = 5) {
+    std::vector<std::string> texts;
+    for (int i = 0; i < seconds * 50 && texts.size() < count; ++i) {
+      if (i > 0) std::this_thread::sleep_for(std::chrono::milliseconds(20));
+      const Json::Value logs = Call("KOVA.ResourceMonitor.Log", "list",
+                                    std::string(R"({"filter": {"loglevel": ")") + level + "\"}}")
+                                   .GetData()["logs"];
+      texts.clear();
+      for (const Json::Value& entry : logs) {
+        texts.push_back(entry["level"].asString() + ": " + entry["event"].asString());
+      }
+    }
+    return texts;
+  }
+
+  kova::TestRoot root_;
+  APITableEntry* table_ = nullptr;
+};
+
+TEST_F(PerfEventE2eTest, RecordedProcRaisesReloadsRecoversAndEndsCleanly) {
+  // Memory 80% in use; the service "websrv" is process 4242 with a child, 30% together.
+  const std::string proc = root_.Path("/snapshot/proc");
+  WriteSystem(proc, 100, 1000, 1000000, 200000);
+  const uint64_t pages = 300000 / (sysconf(_SC_PAGESIZE) / 1024);
+  WriteProcess(proc, {4242, 1, 777, 10, pages / 2, "websrv"});
+  WriteProcess(proc, {4300, 4242, 790, 10, pages / 2, "websrv-worker"});
+  WriteProcess(proc, {4400, 1, 800, 10, pages, "other"});
+  root_.Write("/run/kova/websrv.pid", "4242 777\n");
+  root_.Write("/etc/kova/services/websrv.conf",
+              "command=\"/bin/sleep 300\"\ndisplay_name=\"Web server\"\n");
+  InstallDaemon("--proc " + proc + " --time-scale 0.01");
+  EXPECT_TRUE(AsHost([&] {
+    StartDaemon();
+    // Rules made while the daemon runs reach it by the reload signal.
+    SetRule(R"({"service": "", "type": 0, "resource": 2, "severity": 1, "threshold": 75,
+                "enable": true})");
+    SetRule(R"({"service": "websrv", "type": 1, "resource": 2, "severity": 2, "threshold": 29,
+                "enable": true})");
+    EXPECT_THAT(Events("Warning", 1),
+                ElementsAre("Warning: Memory use of the system has been above 75% for 30 seconds "
+                            "(average 80.0%)."));
+    EXPECT_THAT(
+        Events("Critical", 1),
+        ElementsAre("Critical: Memory use of service \"Web server\" has been above 29% for 30 "
+                    "seconds (average 30.0%)."));
+    // A rule stored without a signal is found all the same.
+    KOVAPERFEVENT_CONF_SETTING rule{};
+    rule = {{}, PERFEVENT_TYPE_SYSTEM, "NAS", PERFEVENT_RESOURCE_MEMORY, 1, 60, 5, 30, 1};
+    ASSERT_EQ(KOVAPerfEventConfAdd(&rule), 0);
+    EXPECT_EQ(Events("Warning", 2).size(), 2u);
+  }));
+  // meminfo can't be read for a while, then the memory goes down.
+  std::filesystem::rename(proc + "/meminfo", proc + "/meminfo.away");
+  std::this_thread::sleep_for(std::chrono::milliseconds(300));
+  WriteSystem(proc, 100, 1000, 1000000, 900000);
+  EXPECT_TRUE(AsHost([&] {
+    const std::vector<std::string> all = Events("", 5);
+    EXPECT_THAT(all, Contains(HasSubstr("Info: Memory use of the system has been back at or "
+                                        "below 75% for 30 seconds (average 10.0%).")));
+    EXPECT_THAT(all, Contains(HasSubstr("Info: Memory use of the system \"NAS\" has been back")));
+    EXPECT_EQ(all.size(), 5u);  // the service's memory stays high
+    EnableEvents(false);
+  }));
+  const std::vector<std::string> lines = DaemonLog();
+  ASSERT_FALSE(lines.empty());
+  EXPECT_EQ(std::count(lines.begin(), lines.end(), "can't read " + proc + "/meminfo"), 1);
+  EXPECT_EQ(std::count_if(lines.begin(), lines.end(),
+                          [](const std::string& line) {
+                            return line.find(") is skipped: the memory counters") !=
+                                   std::string::npos;
+                          }),
+            3);                        // once for each rule on the system's memory, not every cycle
+  EXPECT_EQ(lines.back(), "stopped");  // SIGTERM ended it cleanly
+}
+
+TEST_F(PerfEventE2eTest, AServiceThatBurnsCpuRaisesAWarning) {
+  root_.Write("/etc/kova/services/burner.conf",
+              "command=\"/bin/sh -c \"while :; do :; done\"\"\ndisplay_name=\"Burner\"\n");
+  // The live /proc, a cycle every 250 ms: enough clock ticks for a share of
+  // the CPU to show, even on a busy machine.
+  InstallDaemon("--time-scale 0.05");
+  ASSERT_EQ(QLIBServiceStart("burner", 0), 0);
+  EXPECT_TRUE(AsHost([&] {
+    StartDaemon();
+    // A rule made while the daemon runs reaches it by the reload signal.
+    SetRule(R"({"service": "burner", "type": 1, "resource": 1, "severity": 1, "threshold": 2,
+                "enable": true})");
+    const std::vector<std::string> events = Events("Warning", 1, 15);
+    ASSERT_EQ(events.size(), 1u);
+    EXPECT_EQ(events[0].rfind(
+                  "Warning: CPU use of service \"Burner\" has been above 2% for 30 seconds", 0),
+              0u)
+        << events[0];
+  }));
+}
+
+}  // namespace
+}  // namespace perfeventd

@@ -1,0 +1,45 @@
+// The rules as the rule store holds them, and whether the store has changed
+// since they were read.
+
+#ifndef KOVA_DAEMONS_PERFEVENTD_RULE_LOADER_H_
+#define KOVA_DAEMONS_PERFEVENTD_RULE_LOADER_H_
+
+#include <sys/types.h>
+
+#include <ctime>
+#include <string>
+#include <vector>
+
+#include "perfeventd/rule.h"
+
+namespace perfeventd {
+
+// Replaces `rules` with the enabled rules of the store, in its order. False
+// when the store can't be read; `rules` is then left as it was.
+bool LoadEnabledRules(std::vector<Rule>& rules);
+
+// Notices writes to the rule store that came without a reload signal: the
+// store's files (the database and its write-ahead log) changed since Mark.
+class StoreWatch {
+ public:
+  // Takes the files' state as the one the rules were read from.
+  void Mark();
+  bool Changed() const;
+
+ private:
+  struct FileState {
+    bool exists = false;
+    ino_t inode = 0;
+    off_t size = 0;
+    timespec modified{};
+  };
+  static FileState Look(const std::string& path);
+  static bool Same(const FileState& a, const FileState& b);
+
+  FileState database_;
+  FileState journal_;
+};
+
+}  // namespace perfeventd
+
+#endif  // KOVA_DAEMONS_PERFEVENTD_RULE_LOADER_H_

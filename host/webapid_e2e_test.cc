@@ -18,6 +18,7 @@
 #include <vector>
 
 #include "fake/host_call.h"
+#include "perfeventd/test_support.h"
 #include "src/test_root.h"
 
 namespace {
@@ -129,6 +130,9 @@ class WebApidTest : public ::testing::Test {
   void TearDown() override {
     host_.reset();
     Kova("service stop kovaperfeventd");
+    if (std::filesystem::exists(root_.Path("/etc/kova/services/burner.conf"))) {
+      Kova("service stop burner");
+    }
   }
 
   void AddModule(const std::string& path) {
@@ -262,6 +266,52 @@ TEST_F(WebApidTest, ServesEveryMethodOfTheModule) {
                              "method=set user=admin code=0 ms="));
   EXPECT_THAT(log, Not(HasSubstr(sid)));
   EXPECT_THAT(log, Not(HasSubstr("5ecret")));
+}
+
+TEST_F(WebApidTest, ARuleMadeOverHttpRaisesAWarningFromTheRealDaemon) {
+  // The real daemon as the service, on the live /proc, a cycle every 250 ms:
+  // its 30 s window takes 1.5 s, with enough clock ticks for a CPU share to show.
+  ASSERT_TRUE(perfeventd::InstallDaemonService(KOVA_INSTALL_SERVICE, root_.path(),
+                                               KOVAPERFEVENTD_PATH, "--time-scale 0.05",
+                                               root_.Path("/daemon.err")));
+  root_.Write("/etc/kova/services/burner.conf",
+              "command=\"/bin/sh -c \"while :; do :; done\"\"\ndisplay_name=\"Burner\"\n");
+  Kova("service start burner");
+  Start();
+  const std::string sid = Sid("admin", kAdminPassword);
+  ASSERT_FALSE(sid.empty());
+  // The rule comes first, so the daemon reads it at its start.
+  ASSERT_EQ(Call(kRule, "set",
+                 {{"type", "1"},
+                  {"service", "burner"},
+                  {"severity", "1"},
+                  {"resource", "1"},
+                  {"threshold", "2"},
+                  {"enable", "true"}},
+                 sid)
+                .json,
+            ParseJson(R"({"success": true})"));
+  ASSERT_EQ(Call(kSetting, "set", {{"enable_event", "true"}}, sid).json,
+            ParseJson(R"({"success": true})"));
+
+  const std::string expected = "CPU use of service \"Burner\" has been above 2% for 30 seconds";
+  const auto raised = [&](const char* level) {
+    const Reply reply =
+        Call(kLog, "list", {{"filter", std::string(R"({"loglevel":")") + level + "\"}"}}, sid);
+    for (const Json::Value& entry : reply.json["data"]["logs"]) {
+      if (entry["event"].asString().rfind(expected, 0) == 0) return true;
+    }
+    return false;
+  };
+  // Polled up to a deadline, for a machine under load.
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+  bool found = raised("Warning");
+  while (!found && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    found = raised("Warning");
+  }
+  EXPECT_TRUE(found) << "the daemon's log:\n" << root_.Read("/daemon.err");
+  EXPECT_FALSE(raised("Critical"));  // the rule's severity sets the level
 }
 
 const std::vector<std::pair<std::string, std::string>> kMethods = {

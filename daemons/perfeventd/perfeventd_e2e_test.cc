@@ -45,10 +45,8 @@ class PerfEventE2eTest : public ::testing::Test {
   // Installs the service: the daemon with `options`, its system-log lines
   // into /daemon.err.
   void InstallDaemon(const std::string& options) {
-    const std::string command = std::string(KOVA_INSTALL_SERVICE) + " " + root_.path() +
-                                " /bin/sh -c \"exec " KOVAPERFEVENTD_PATH " " + options +
-                                " --log-stderr 2>>" + root_.Path("/daemon.err") + "\"";
-    ASSERT_EQ(system(command.c_str()), 0);
+    ASSERT_TRUE(InstallDaemonService(KOVA_INSTALL_SERVICE, root_.path(), KOVAPERFEVENTD_PATH,
+                                     options, root_.Path("/daemon.err")));
   }
 
   // The daemon's system-log lines, without the "kovaperfeventd[pid]: ".

@@ -7,6 +7,7 @@
 #include <sys/types.h>
 
 #include <cstdint>
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
@@ -49,6 +50,17 @@ inline void WriteSystem(const std::string& dir, uint64_t busy, uint64_t total,
   WriteFile(dir + "/meminfo", "MemTotal:       " + std::to_string(memory_total_kib) +
                                   " kB\nMemFree:          1000 kB\nMemAvailable:   " +
                                   std::to_string(memory_available_kib) + " kB\n");
+}
+
+// Installs `program` as the platform service "kovaperfeventd" in the system
+// root `root` with the script install-service.sh at `script`, run with
+// `options` and its system-log lines appended to the file `log`.
+inline bool InstallDaemonService(const std::string& script, const std::string& root,
+                                 const std::string& program, const std::string& options,
+                                 const std::string& log) {
+  const std::string command = script + " " + root + " /bin/sh -c \"exec " + program + " " +
+                              options + " --log-stderr 2>>" + log + "\"";
+  return std::system(command.c_str()) == 0;
 }
 
 // The performance-event log's records as KOVALogGet1 prints them, without

@@ -108,9 +108,7 @@ struct Reply {
 class WebApidTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    std::filesystem::create_directories(root_.Path("/usr/share/kova"));
-    std::filesystem::copy(KOVA_TEXTS_DIR, root_.Path("/usr/share/kova/texts"),
-                          std::filesystem::copy_options::recursive);
+    root_.InstallTexts(KOVA_TEXTS_DIR);
     root_.Write("/opt/kovaperfeventd.sh", kDaemon, 0755);
     root_.Write("/etc/kova/services/kovaperfeventd.conf",
                 "command=\"/bin/sh " + root_.Path("/opt/kovaperfeventd.sh") + "\"\n");

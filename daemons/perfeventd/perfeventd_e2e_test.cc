@@ -5,7 +5,6 @@
 // with "Log" "list". The daemon runs with a time scale, so a 30 s window takes
 // well under a second, on recorded /proc files or on the live /proc.
 
-#include <dlfcn.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -15,8 +14,8 @@
 #include <sstream>
 #include <thread>
 
+#include "e2e/module_host.h"
 #include "fake/host_call.h"
-#include "fake/run_in_child.h"
 #include "kova/perfevent.h"
 #include "kova/service.h"
 #include "kova/webapi.h"
@@ -33,9 +32,7 @@ using ::testing::HasSubstr;
 class PerfEventE2eTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    std::filesystem::create_directories(root_.Path("/usr/share/kova"));
-    std::filesystem::copy(KOVA_TEXTS_DIR, root_.Path("/usr/share/kova/texts"),
-                          std::filesystem::copy_options::recursive);
+    root_.InstallTexts(KOVA_TEXTS_DIR);
     std::filesystem::create_directories(root_.Path("/run/kova"));
   }
   void TearDown() override {
@@ -71,25 +68,10 @@ class PerfEventE2eTest : public ::testing::Test {
 
   // Runs `body` in a child with the host's ids (unprivileged, saved ids 0),
   // over the loaded module.
-  bool AsHost(const std::function<void()>& body) {
-    return kova_fake::RunInChild([&] {
-      ASSERT_EQ(setresgid(1000, 1000, 0), 0);
-      ASSERT_EQ(setresuid(1000, 1000, 0), 0);
-      void* module = dlopen(KOVA_MODULE_PATH, RTLD_NOW | RTLD_LOCAL);
-      ASSERT_NE(module, nullptr) << dlerror();
-      table_ = reinterpret_cast<GetAPITableFunc>(dlsym(module, kGetAPITableSymbol))();
-      body();
-    });
-  }
+  bool AsHost(const std::function<void()>& body) { return host_.Run(KOVA_MODULE_PATH, body); }
 
   KOVA::APIResponse Call(const char* api, const char* method, const std::string& params) {
-    for (const APITableEntry* row = table_; row != nullptr && row->api != nullptr; ++row) {
-      if (std::string(row->api) == api && std::string(row->method) == method) {
-        return kova_fake::CallHandler(row->handler, params);
-      }
-    }
-    ADD_FAILURE() << api << " " << method << " not in the table";
-    return KOVA::APIResponse();
+    return host_.Call(api, method, params);
   }
 
   void SetRule(const std::string& rule) {
@@ -123,7 +105,7 @@ class PerfEventE2eTest : public ::testing::Test {
   }
 
   kova::TestRoot root_;
-  APITableEntry* table_ = nullptr;
+  kova_e2e::ModuleHost host_;
 };
 
 TEST_F(PerfEventE2eTest, RecordedProcRaisesReloadsRecoversAndEndsCleanly) {

@@ -4,7 +4,6 @@
 // keep the rules for real. Each test runs the module in a child process with
 // the host's ids: unprivileged effective ids, saved ids 0.
 
-#include <dlfcn.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/socket.h>
@@ -21,8 +20,8 @@
 #include <thread>
 #include <vector>
 
+#include "e2e/module_host.h"
 #include "fake/host_call.h"
-#include "fake/run_in_child.h"
 #include "kova/conf.h"
 #include "kova/log.h"
 #include "kova/service.h"
@@ -84,9 +83,7 @@ class StatisticsService {
 class ModuleTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    std::filesystem::create_directories(root_.Path("/usr/share/kova"));
-    std::filesystem::copy(KOVA_TEXTS_DIR, root_.Path("/usr/share/kova/texts"),
-                          std::filesystem::copy_options::recursive);
+    root_.InstallTexts(KOVA_TEXTS_DIR);
     root_.Write("/opt/kovaperfeventd.sh", kDaemon, 0755);
     root_.Write("/etc/kova/services/kovaperfeventd.conf",
                 "command=\"/bin/sh " + root_.Path("/opt/kovaperfeventd.sh") +
@@ -104,14 +101,7 @@ class ModuleTest : public ::testing::Test {
 
   // Runs `body` in a child with the host's ids, over the loaded module.
   bool AsHost(const std::function<void()>& body) {
-    return kova_fake::RunInChild([&] {
-      ASSERT_EQ(setresgid(1000, 1000, 0), 0);
-      ASSERT_EQ(setresuid(1000, 1000, 0), 0);
-      void* module = dlopen(KOVA_MODULE_PATH, RTLD_NOW | RTLD_LOCAL);
-      ASSERT_NE(module, nullptr) << dlerror();
-      auto get_table = reinterpret_cast<GetAPITableFunc>(dlsym(module, kGetAPITableSymbol));
-      ASSERT_NE(get_table, nullptr);
-      table_ = get_table();
+    return host_.Run(KOVA_MODULE_PATH, [&] {
       body();
       EXPECT_EQ(geteuid(), 1000u);  // every privileged step gave root back
       EXPECT_EQ(getegid(), 1000u);
@@ -120,13 +110,7 @@ class ModuleTest : public ::testing::Test {
 
   KOVA::APIResponse Call(const char* api, const char* method, const std::string& params = "{}",
                          const std::string& language = "enu") {
-    for (const APITableEntry* row = table_; row != nullptr && row->api != nullptr; ++row) {
-      if (std::string(row->api) == api && std::string(row->method) == method) {
-        return kova_fake::CallHandler(row->handler, params, language);
-      }
-    }
-    ADD_FAILURE() << api << " " << method << " not in the table";
-    return KOVA::APIResponse();
+    return host_.Call(api, method, params, language);
   }
 
   std::string Conf(const char* key) {
@@ -135,7 +119,7 @@ class ModuleTest : public ::testing::Test {
   }
 
   kova::TestRoot root_;
-  APITableEntry* table_ = nullptr;
+  kova_e2e::ModuleHost host_;
 };
 
 TEST_F(ModuleTest, SettingsAreWrittenAndTheDaemonRuns) {

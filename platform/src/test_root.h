@@ -56,6 +56,14 @@ class TestRoot {
     chmod(real.c_str(), mode);
   }
 
+  // Copies the string tables of the source tree, `texts_dir`, to where the
+  // platform looks them up.
+  void InstallTexts(const std::string& texts_dir) const {
+    std::filesystem::create_directories(Path("/usr/share/kova"));
+    std::filesystem::copy(texts_dir, Path("/usr/share/kova/texts"),
+                          std::filesystem::copy_options::recursive);
+  }
+
   // The content of the system path `system_path`, empty when it can't be read.
   std::string Read(const std::string& system_path) const {
     std::ifstream in(Path(system_path));

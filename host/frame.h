@@ -35,6 +35,9 @@ class FrameReader {
  public:
   explicit FrameReader(int fd) : fd_(fd) {}
   IoResult Read(std::string& payload, size_t max_size, Clock::time_point deadline);
+  // Whether bytes already taken from the descriptor wait to be read: poll(2)
+  // on the descriptor no longer reports them.
+  bool Buffered() const { return buffer_.size() > start_; }
 
  private:
   // Reads until `size` unread bytes are buffered.

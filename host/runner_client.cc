@@ -186,8 +186,12 @@ void RunnerClient::Dispatch() {
     if (fd_ >= 0 && !SendWaiting()) continue;
 
     pollfd fds[2] = {{wake_fd_, POLLIN, 0}, {fd_, POLLIN, 0}};
+    // An answer that came in with the previous one is already in the reader.
+    const bool buffered = !sent_.empty() && reader_ != nullptr && reader_->Buffered();
     int timeout = -1;
-    if (!sent_.empty()) {
+    if (buffered) {
+      timeout = 0;
+    } else if (!sent_.empty()) {
       const auto left = std::chrono::ceil<std::chrono::milliseconds>(running_since_ +
                                                                      call_timeout_ - Clock::now());
       timeout = static_cast<int>(std::clamp<long long>(left.count(), 0, 60000));
@@ -208,7 +212,7 @@ void RunnerClient::Dispatch() {
       }
       continue;
     }
-    if (fd_ >= 0 && fds[1].revents != 0) {
+    if (fd_ >= 0 && (buffered || fds[1].revents != 0)) {
       Pending* running = sent_.front();
       const IoResult got =
           ReceiveAnswer(*reader_, *running->answer, running_since_ + call_timeout_);

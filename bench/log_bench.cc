@@ -17,11 +17,11 @@
 #include <string>
 #include <vector>
 
-#include "fake/host_call.h"
 #include "fake/kova_fake.h"
 #include "kova/log.h"
 #include "log/log.h"
 #include "log/log_reader.h"
+#include "test_support/host_call.h"
 
 namespace {
 
@@ -99,7 +99,7 @@ void BM_LogList(benchmark::State& state) {
   const std::string params =
       state.range(1) ? R"({"limit": 50, "filter": {"keyword": "latency"}})" : R"({"limit": 50})";
   for (auto _ : state) {
-    const KOVA::APIResponse response = kova_fake::CallHandler(log_list_v1, params);
+    const KOVA::APIResponse response = kova_test::CallHandler(log_list_v1, params);
     if (response.GetData()["logs"].size() != 50) state.SkipWithError("short page");
   }
   Report(state);

@@ -23,9 +23,13 @@
 #include "perfeventd/monitor.h"
 #include "perfeventd/object_directory.h"
 #include "perfeventd/proc_reader.h"
-#include "perfeventd/test_support.h"
+#include "test_support/recorded_proc.h"
 
 namespace perfeventd {
+
+using kova_test::WriteFile;
+using kova_test::WriteProcess;
+using kova_test::WriteSystem;
 namespace {
 
 constexpr int kServices = 250;  // each one process; the first 50 have a child too

@@ -4,7 +4,7 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include "fake/run_in_child.h"
+#include "test_support/run_in_child.h"
 
 namespace kova_host {
 namespace {
@@ -28,7 +28,7 @@ TEST_F(PrivilegesTest, LooksUpUnprivilegedAccountsOnly) {
 }
 
 TEST_F(PrivilegesTest, DroppedForGoodRootCannotBeRegained) {
-  EXPECT_TRUE(kova_fake::RunInChild([&] {
+  EXPECT_TRUE(kova_test::RunInChild([&] {
     std::string error;
     ASSERT_TRUE(DropForGood(account_, error)) << error;
     const IdSnapshot ids = SnapshotIds();
@@ -40,7 +40,7 @@ TEST_F(PrivilegesTest, DroppedForGoodRootCannotBeRegained) {
 }
 
 TEST_F(PrivilegesTest, RaisedOrRegroupedIdsArePutBack) {
-  EXPECT_TRUE(kova_fake::RunInChild([&] {
+  EXPECT_TRUE(kova_test::RunInChild([&] {
     std::string error;
     ASSERT_TRUE(TakeEffectiveIds(account_, error)) << error;
     const IdSnapshot wanted = SnapshotIds();

@@ -17,13 +17,13 @@
 #include <thread>
 #include <vector>
 
-#include "fake/host_call.h"
-#include "perfeventd/test_support.h"
-#include "src/test_root.h"
+#include "test_support/host_call.h"
+#include "test_support/perfevent_daemon.h"
+#include "test_support/test_root.h"
 
 namespace {
 
-using kova_fake::ParseJson;
+using kova_test::ParseJson;
 using ::testing::HasSubstr;
 using ::testing::Not;
 
@@ -48,7 +48,7 @@ std::string Form(const std::vector<std::pair<std::string, std::string>>& fields)
 // A kova-webapid over the test's root; stopped with SIGTERM at the end.
 class Host {
  public:
-  Host(const kova::TestRoot& root, const std::vector<std::string>& args)
+  Host(const kova_test::TestRoot& root, const std::vector<std::string>& args)
       : log_(root.Path("/host.log")) {
     std::vector<std::string> argv = {KOVA_WEBAPID_PATH,     "--port",   "0",         "--modules",
                                      root.Path("/modules"), "--static", KOVA_WWW_DIR};
@@ -188,7 +188,7 @@ class WebApidTest : public ::testing::Test {
 
   static int Code(const Reply& reply) { return reply.json["error"]["code"].asInt(); }
 
-  kova::TestRoot root_;
+  kova_test::TestRoot root_;
   std::unique_ptr<Host> host_;
 };
 
@@ -269,9 +269,9 @@ TEST_F(WebApidTest, ServesEveryMethodOfTheModule) {
 TEST_F(WebApidTest, ARuleMadeOverHttpRaisesAWarningFromTheRealDaemon) {
   // The real daemon as the service, on the live /proc, a cycle every 250 ms:
   // its 30 s window takes 1.5 s, with enough clock ticks for a CPU share to show.
-  ASSERT_TRUE(perfeventd::InstallDaemonService(KOVA_INSTALL_SERVICE, root_.path(),
-                                               KOVAPERFEVENTD_PATH, "--time-scale 0.05",
-                                               root_.Path("/daemon.err")));
+  ASSERT_TRUE(kova_test::InstallDaemonService(KOVA_INSTALL_SERVICE, root_.path(),
+                                              KOVAPERFEVENTD_PATH, "--time-scale 0.05",
+                                              root_.Path("/daemon.err")));
   root_.Write("/etc/kova/services/burner.conf",
               "command=\"/bin/sh -c \"while :; do :; done\"\"\ndisplay_name=\"Burner\"\n");
   Kova("service start burner");

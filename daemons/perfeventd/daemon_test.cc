@@ -7,7 +7,7 @@
 
 #include <cstdio>
 
-#include "src/test_root.h"
+#include "test_support/test_root.h"
 
 namespace perfeventd {
 namespace {
@@ -15,7 +15,7 @@ namespace {
 using ::testing::HasSubstr;
 
 TEST(DaemonTest, RefusesABadCommandLine) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   const struct {
     std::string args;
     int status;

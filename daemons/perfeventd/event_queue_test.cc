@@ -6,17 +6,19 @@
 #include <unistd.h>
 
 #include "kova/log.h"
-#include "perfeventd/test_support.h"
-#include "src/test_root.h"
+#include "test_support/perfevent_daemon.h"
+#include "test_support/test_root.h"
 
 namespace perfeventd {
+
+using kova_test::LogLines;
 namespace {
 
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 
 // The log's records as KOVALogGet1 prints them, without their ids.
-std::vector<std::string> LogLines(const kova::TestRoot& root) {
+std::vector<std::string> LogLines(const kova_test::TestRoot& root) {
   const std::string out = root.Path("/tmp/dump");
   EXPECT_EQ(KOVALogGet1(kLogTypePerfEvent, out.c_str(), "enu"), 0);
   std::vector<std::string> lines;
@@ -27,7 +29,7 @@ std::vector<std::string> LogLines(const kova::TestRoot& root) {
 }
 
 TEST(EventQueueTest, KeepsEventsThroughAFailingLogAndARestart) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   const std::string spill = root.Path("/var/lib/kova/perfevent/waiting_events");
   root.Write("/var/log/kova", "not a directory");  // the log store can't be made
   std::vector<std::string> notices;
@@ -61,7 +63,7 @@ TEST(EventQueueTest, KeepsEventsThroughAFailingLogAndARestart) {
 }
 
 TEST(EventQueueTest, DropsTheOldestBeyondItsCapacity) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   std::vector<std::string> notices;
   EventQueue queue(root.Path("/var/lib/kova/perfevent/waiting_events"), 2,
                    [&](int, const std::string& text) { notices.push_back(text); });

@@ -14,15 +14,20 @@
 #include <sstream>
 #include <thread>
 
-#include "e2e/module_host.h"
-#include "fake/host_call.h"
 #include "kova/perfevent.h"
 #include "kova/service.h"
 #include "kova/webapi.h"
-#include "perfeventd/test_support.h"
-#include "src/test_root.h"
+#include "test_support/host_call.h"
+#include "test_support/module_host.h"
+#include "test_support/perfevent_daemon.h"
+#include "test_support/recorded_proc.h"
+#include "test_support/test_root.h"
 
 namespace perfeventd {
+
+using kova_test::InstallDaemonService;
+using kova_test::WriteProcess;
+using kova_test::WriteSystem;
 namespace {
 
 using ::testing::Contains;
@@ -104,8 +109,8 @@ class PerfEventE2eTest : public ::testing::Test {
     return texts;
   }
 
-  kova::TestRoot root_;
-  kova_e2e::ModuleHost host_;
+  kova_test::TestRoot root_;
+  kova_test::ModuleHost host_;
 };
 
 TEST_F(PerfEventE2eTest, RecordedProcRaisesReloadsRecoversAndEndsCleanly) {

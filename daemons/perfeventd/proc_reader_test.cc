@@ -4,10 +4,14 @@
 
 #include "kova/perfevent.h"
 #include "perfeventd/measurements.h"
-#include "perfeventd/test_support.h"
-#include "src/test_root.h"
+#include "test_support/recorded_proc.h"
+#include "test_support/test_root.h"
 
 namespace perfeventd {
+
+using kova_test::WriteFile;
+using kova_test::WriteProcess;
+using kova_test::WriteSystem;
 namespace {
 
 // The value measured, -1 for none, -2 for a problem.
@@ -17,7 +21,7 @@ double ValueOf(const Measured& measured) {
 }
 
 TEST(ProcReaderTest, ReadsOnePassOfRecordedFiles) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   const std::string proc = root.Path("/proc");
   const std::string sys = root.Path("/sys");
   WriteSystem(proc, 250, 1000, 4000000, 1000000);

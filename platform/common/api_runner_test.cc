@@ -3,12 +3,12 @@
 
 #include <stdexcept>
 
-#include "fake/host_call.h"
 #include "kova/webapi.h"
+#include "test_support/host_call.h"
 
 namespace {
 
-using kova_fake::ParseJson;
+using kova_test::ParseJson;
 
 void Echo(KOVA::APIRequest* request, KOVA::APIResponse* response) {
   Json::Value data;

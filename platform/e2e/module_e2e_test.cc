@@ -20,17 +20,17 @@
 #include <thread>
 #include <vector>
 
-#include "e2e/module_host.h"
-#include "fake/host_call.h"
 #include "kova/conf.h"
 #include "kova/log.h"
 #include "kova/service.h"
 #include "kova/webapi.h"
-#include "src/test_root.h"
+#include "test_support/host_call.h"
+#include "test_support/module_host.h"
+#include "test_support/test_root.h"
 
 namespace {
 
-using kova_fake::ParseJson;
+using kova_test::ParseJson;
 using ::testing::HasSubstr;
 
 constexpr char kSetting[] = "KOVA.ResourceMonitor.Setting";
@@ -118,8 +118,8 @@ class ModuleTest : public ::testing::Test {
     return QLIBCFileGetKeyValue(kKovaInfoConf, key, value, sizeof(value), 0) > 0 ? value : "-";
   }
 
-  kova::TestRoot root_;
-  kova_e2e::ModuleHost host_;
+  kova_test::TestRoot root_;
+  kova_test::ModuleHost host_;
 };
 
 TEST_F(ModuleTest, SettingsAreWrittenAndTheDaemonRuns) {

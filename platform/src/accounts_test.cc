@@ -6,7 +6,7 @@
 #include <string>
 
 #include "kova/error.h"
-#include "src/test_root.h"
+#include "test_support/test_root.h"
 
 namespace {
 
@@ -15,7 +15,7 @@ int Check(const std::string& name, const std::string& password, bool& admin) {
 }
 
 TEST(AccountsTest, AddsChecksChangesAndRemovesAccounts) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   bool admin = true;
   EXPECT_EQ(Check("admin", "secret", admin), 0);  // no file yet: no accounts
   ASSERT_EQ(kova::AddAccount("admin", "s3cret: with blanks", true), 0);
@@ -51,7 +51,7 @@ TEST(AccountsTest, AddsChecksChangesAndRemovesAccounts) {
 }
 
 TEST(AccountsTest, RefusesBadNamesPasswordsAndFiles) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   const struct {
     std::string name;
     std::string password;

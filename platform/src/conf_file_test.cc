@@ -9,15 +9,15 @@
 #include <filesystem>
 #include <string>
 
-#include "fake/run_in_child.h"
 #include "kova/conf.h"
 #include "kova/error.h"
 #include "src/system_root.h"
-#include "src/test_root.h"
+#include "test_support/run_in_child.h"
+#include "test_support/test_root.h"
 
 namespace {
 
-using kova::TestRoot;
+using kova_test::TestRoot;
 
 TEST(ConfFileTest, ReadsKeysAsWritten) {
   TestRoot root;
@@ -170,7 +170,7 @@ TEST(ConfFileTest, KilledWriterNeverLeavesAPartialFile) {
 TEST(ConfFileTest, UnprivilegedWriterFailsWithPermissionDenied) {
   TestRoot root;
   ASSERT_EQ(QLIBCINFOSetKeyValue("resourcemonitor_history", "yes"), 0);
-  EXPECT_TRUE(kova_fake::RunInChild([] {
+  EXPECT_TRUE(kova_test::RunInChild([] {
     ASSERT_EQ(setresgid(1000, 1000, 1000), 0);
     ASSERT_EQ(setresuid(1000, 1000, 1000), 0);
     EXPECT_EQ(QLIBCINFOSetKeyValue("resourcemonitor_history", "no"), -1);

@@ -12,12 +12,12 @@
 #include "kova/conf.h"
 #include "kova/error.h"
 #include "kova/log.h"
-#include "src/test_root.h"
+#include "test_support/test_root.h"
 
 namespace {
 
 using kova::LogRecord;
-using kova::TestRoot;
+using kova_test::TestRoot;
 
 // The lines that KOVALogGet1 writes for the performance-event log.
 std::vector<std::string> Dump(const TestRoot& root) {

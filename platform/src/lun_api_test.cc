@@ -2,18 +2,18 @@
 
 #include <gtest/gtest.h>
 
-#include "fake/host_call.h"
 #include "kova/error.h"
 #include "kova/webapi.h"
 #include "src/lun_registry.h"
-#include "src/test_root.h"
+#include "test_support/host_call.h"
+#include "test_support/test_root.h"
 
 namespace {
 
-using kova_fake::ParseJson;
+using kova_test::ParseJson;
 
 TEST(LunRegistryTest, AddsListsAndRemoves) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   std::vector<kova::Lun> luns;
   ASSERT_EQ(kova::ReadLuns(luns), 0);
   EXPECT_TRUE(luns.empty());
@@ -40,7 +40,7 @@ TEST(LunRegistryTest, AddsListsAndRemoves) {
 }
 
 TEST(LunApiTest, AnswersGetFromTheRegistry) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   ASSERT_EQ(kova::AddLun({"b-2", "Backup", 2048, "/volume1"}), 0);
   const struct {
     const char* params;

@@ -5,7 +5,7 @@
 
 #include <stdexcept>
 
-#include "fake/run_in_child.h"
+#include "test_support/run_in_child.h"
 
 namespace {
 
@@ -23,7 +23,7 @@ TEST(PrivilegeTest, RaisesForTheWorkAndRestoresAfterIt) {
       {"root", {0, 0, 0}, {0, 0, 0}, true},
   };
   for (const auto& c : cases) {
-    EXPECT_TRUE(kova_fake::RunInChild([&c] {
+    EXPECT_TRUE(kova_test::RunInChild([&c] {
       ASSERT_EQ(setresgid(c.gid[0], c.gid[1], c.gid[2]), 0);
       ASSERT_EQ(setresuid(c.uid[0], c.uid[1], c.uid[2]), 0);
       try {
@@ -47,7 +47,7 @@ TEST(PrivilegeTest, RaisesForTheWorkAndRestoresAfterIt) {
 }
 
 TEST(PrivilegeTest, BecomesRootForGoodFromTheHostsIds) {
-  EXPECT_TRUE(kova_fake::RunInChild([] {
+  EXPECT_TRUE(kova_test::RunInChild([] {
     ASSERT_EQ(setresgid(1000, 1000, 0), 0);
     ASSERT_EQ(setresuid(1000, 1000, 0), 0);
     kova::RootScope scope;

@@ -6,7 +6,7 @@
 
 #include "kova/error.h"
 #include "kova/perfevent.h"
-#include "src/test_root.h"
+#include "test_support/test_root.h"
 
 namespace {
 
@@ -37,7 +37,7 @@ std::vector<std::string> Listed() {
 }
 
 TEST(RuleStoreTest, AssignsIdsThatAreNeverReusedAndListsInCreationOrder) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   EXPECT_EQ(Listed(), std::vector<std::string>());  // no store yet: an empty list
   EXPECT_EQ(KOVAPerfEventConfListGet("1"), nullptr);
   for (const char* service : {"smb", "nfs", "web"}) {
@@ -62,7 +62,7 @@ TEST(RuleStoreTest, AssignsIdsThatAreNeverReusedAndListsInCreationOrder) {
 }
 
 TEST(RuleStoreTest, ChangesARecordOfAListInPlace) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   KOVAPERFEVENT_CONF_SETTING rule =
       Rule(PERFEVENT_TYPE_SYSTEM, "", PERFEVENT_RESOURCE_MEMORY, PERFEVENT_SEVERITY_CRITICAL);
   ASSERT_EQ(KOVAPerfEventConfAdd(&rule), 0);
@@ -90,7 +90,7 @@ TEST(RuleStoreTest, ChangesARecordOfAListInPlace) {
 }
 
 TEST(RuleStoreTest, RefusesDuplicatesOfObjectResourceAndSeverity) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   KOVAPERFEVENT_CONF_SETTING first =
       Rule(PERFEVENT_TYPE_SERVICE, "smb", PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_WARNING, 80);
   KOVAPERFEVENT_CONF_SETTING critical =
@@ -112,7 +112,7 @@ TEST(RuleStoreTest, RefusesDuplicatesOfObjectResourceAndSeverity) {
 }
 
 TEST(RuleStoreTest, RefusesRulesTheDaemonCannotWatch) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   auto with = [](auto change) {
     KOVAPERFEVENT_CONF_SETTING rule =
         Rule(PERFEVENT_TYPE_SERVICE, "smb", PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_WARNING);

@@ -11,11 +11,11 @@
 #include "src/service_process.h"
 #include "src/services.h"
 #include "src/system_root.h"
-#include "src/test_root.h"
+#include "test_support/test_root.h"
 
 namespace {
 
-using kova::TestRoot;
+using kova_test::TestRoot;
 using std::chrono::milliseconds;
 
 // A service that notes its root and user, counts reloads and ends on SIGTERM.

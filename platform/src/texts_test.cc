@@ -5,7 +5,7 @@
 
 #include "kova/conf.h"
 #include "kova/text.h"
-#include "src/test_root.h"
+#include "test_support/test_root.h"
 
 namespace {
 
@@ -19,7 +19,7 @@ class TextsTest : public ::testing::Test {
     root_.Write("/usr/share/kova/texts/enu/b.ini", "[log]\nlog_action = \"Event\"\n");
     root_.Write("/usr/share/kova/texts/ger/a.ini", "[log]\nlog_time = \"Zeit\"\n");
   }
-  kova::TestRoot root_;
+  kova_test::TestRoot root_;
 };
 
 TEST_F(TextsTest, LooksKeysUpInTheSystemLanguageWithEnglishBehind) {
@@ -44,7 +44,7 @@ TEST_F(TextsTest, LooksKeysUpInTheSystemLanguageWithEnglishBehind) {
 
 TEST_F(TextsTest, ShipsTheModulesKeysInEveryLanguage) {
   for (const char* language : {"enu", "ger"}) {
-    kova::TestRoot root;
+    kova_test::TestRoot root;
     const std::string source =
         std::string(KOVA_TEXTS_DIR) + "/" + language + "/resourcemonitor.ini";
     std::ifstream in(source);

@@ -8,10 +8,10 @@
 #include <string>
 #include <thread>
 
-#include "fake/host_call.h"
 #include "kova/error.h"
 #include "src/system_root.h"
-#include "src/test_root.h"
+#include "test_support/host_call.h"
+#include "test_support/test_root.h"
 
 namespace {
 
@@ -19,7 +19,7 @@ namespace {
 // all when it is null) and keeps the request line it got.
 class Service {
  public:
-  Service(const kova::TestRoot& root, const char* reply) {
+  Service(const kova_test::TestRoot& root, const char* reply) {
     kova::MakeDirectories(root.Path("/run/kova"), 0755);
     const std::string path = root.Path("/run/kova/statd.sock");
     listener_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
@@ -72,7 +72,7 @@ TEST(TransmitorTest, SendsOneLineAndReadsOneLine) {
       {nullptr, -1, KOVA_ERR_TIMEOUT, -1, R"("untouched")"},
   };
   for (const auto& c : cases) {
-    kova::TestRoot root;
+    kova_test::TestRoot root;
     Service service(root, c.reply);
     Transmitor transmitor("localhost");
     Json::Value request;
@@ -83,13 +83,13 @@ TEST(TransmitorTest, SendsOneLineAndReadsOneLine) {
     }
     Json::Value reply = "untouched";
     EXPECT_EQ(transmitor.GetDataJson(reply), c.get) << c.reply;
-    EXPECT_EQ(reply, kova_fake::ParseJson(c.data)) << c.reply;
+    EXPECT_EQ(reply, kova_test::ParseJson(c.data)) << c.reply;
     EXPECT_EQ(service.request(), "{\"request\":\"reload\"}\n");
   }
 }
 
 TEST(TransmitorTest, FailsWithoutTheService) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   Transmitor transmitor("localhost");
   EXPECT_EQ(transmitor.Transmit(Json::Value()), -1);
   EXPECT_EQ(QLIBCErrGet(), KOVA_ERR_CONNECT);

@@ -4,12 +4,12 @@
 #include "kova/error.h"
 #include "kova/service.h"
 #include "src/system_root.h"
-#include "src/test_root.h"
+#include "test_support/test_root.h"
 
 namespace {
 
 TEST(VolumesTest, FollowsShareLinksIntoVolumes) {
-  kova::TestRoot root;
+  kova_test::TestRoot root;
   kova::MakeDirectories(root.Path("/volume1/@database/pgsql"), 0755);
   kova::MakeDirectories(root.Path("/volume2/share"), 0755);
   kova::MakeDirectories(root.Path("/var/services"), 0755);

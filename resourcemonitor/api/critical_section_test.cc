@@ -9,7 +9,7 @@
 #include <vector>
 
 #include "fake/kova_fake.h"
-#include "fake/run_in_child.h"
+#include "test_support/run_in_child.h"
 
 namespace {
 
@@ -86,7 +86,7 @@ TEST_F(CriticalSectionTest, RaisesToRootAndRestoresTheLoweredIds) {
 }
 
 TEST_F(CriticalSectionTest, LogsAndGoesOnWhenTheProcessCannotRaise) {
-  EXPECT_TRUE(kova_fake::RunInChild([] {
+  EXPECT_TRUE(kova_test::RunInChild([] {
     ASSERT_EQ(setresgid(kNobody, kNobody, kNobody), 0);
     ASSERT_EQ(setresuid(kNobody, kNobody, kNobody), 0);
 

@@ -7,15 +7,15 @@
 #include <string>
 #include <vector>
 
-#include "fake/host_call.h"
 #include "fake/kova_fake.h"
-#include "fake/run_in_child.h"
 #include "kova/webapi.h"
+#include "test_support/host_call.h"
+#include "test_support/run_in_child.h"
 
 namespace {
 
-using kova_fake::ParseJson;
-using kova_fake::RunInChild;
+using kova_test::ParseJson;
+using kova_test::RunInChild;
 using ::testing::ElementsAre;
 
 struct Module {
@@ -46,7 +46,7 @@ KOVA::APIResponse Call(const Module& module, const char* api, const char* method
                        const std::string& params) {
   for (const APITableEntry* row = module.table; row->api != nullptr; ++row) {
     if (std::string(row->api) == api && std::string(row->method) == method) {
-      return kova_fake::CallHandler(row->handler, params);
+      return kova_test::CallHandler(row->handler, params);
     }
   }
   ADD_FAILURE() << api << " " << method << " not in the table";

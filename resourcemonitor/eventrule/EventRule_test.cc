@@ -11,18 +11,18 @@
 #include <regex>
 #include <tuple>
 
-#include "fake/host_call.h"
 #include "fake/kova_fake.h"
-#include "fake/run_in_child.h"
 #include "kova/conf.h"
 #include "kova/error.h"
 #include "setting/resource_api.h"
+#include "test_support/host_call.h"
+#include "test_support/run_in_child.h"
 
 namespace {
 
-using kova_fake::CallHandler;
-using kova_fake::ParseJson;
 using kova_fake::RuleListAnswer;
+using kova_test::CallHandler;
+using kova_test::ParseJson;
 using Strings = std::vector<std::string>;
 
 constexpr char kGet1[] = "KOVAPerfEventConfListGet 1";
@@ -267,7 +267,7 @@ TEST_F(EventRuleTest, ListCutsThePageCountsAllRulesAndPassesSupportThrough) {
 // Writes to the store need root; the host process runs with lowered effective ids.
 TEST_F(EventRuleTest, WritersRaiseTheProcessAndReadersDoNot) {
   if (getuid() != 0) GTEST_SKIP() << "needs root to change effective ids";
-  EXPECT_TRUE(kova_fake::RunInChild([] {
+  EXPECT_TRUE(kova_test::RunInChild([] {
     Seed(0, "a");
     ASSERT_EQ(setresgid(-1, 65534, -1), 0);
     ASSERT_EQ(setresuid(-1, 65534, -1), 0);

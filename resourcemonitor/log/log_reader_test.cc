@@ -8,14 +8,14 @@
 #include <string>
 #include <vector>
 
-#include "fake/host_call.h"
 #include "fake/kova_fake.h"
-#include "fake/run_in_child.h"
 #include "kova/log.h"
+#include "test_support/host_call.h"
+#include "test_support/run_in_child.h"
 
 namespace {
 
-using kova_fake::ParseJson;
+using kova_test::ParseJson;
 using ::testing::ElementsAreArray;
 using ::testing::UnorderedElementsAreArray;
 
@@ -203,7 +203,7 @@ TEST(LogReaderTest, FetchPathsCleanUpAndRaiseForTheFetch) {
       {false, true, false, true, true, 65534},
   };
   for (const auto& c : cases) {
-    EXPECT_TRUE(kova_fake::RunInChild([&c] {
+    EXPECT_TRUE(kova_test::RunInChild([&c] {
       kova_fake::Reset();
       if (c.log_exists) kova_fake::SetLogLines({Line("Info", kTime1, "e")});
       kova_fake::FailLogPath(c.path_fails);

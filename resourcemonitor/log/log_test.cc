@@ -13,15 +13,15 @@
 #include <vector>
 
 #include "api/error_report.h"
-#include "fake/host_call.h"
 #include "fake/kova_fake.h"
-#include "fake/run_in_child.h"
 #include "kova/log.h"
+#include "test_support/host_call.h"
+#include "test_support/run_in_child.h"
 
 namespace {
 
-using kova_fake::CallHandler;
-using kova_fake::ParseJson;
+using kova_test::CallHandler;
+using kova_test::ParseJson;
 using State = KOVA::APIResponse::State;
 
 const std::string kTime1 = KOVALogConvertTime1(1700000000);
@@ -128,7 +128,7 @@ TEST_F(LogApiTest, ListOfAnUnreadableLogAnswersTheRecord) {
 }
 
 TEST_F(LogApiTest, ClearSucceedsAlwaysAndRunsAsRoot) {
-  EXPECT_TRUE(kova_fake::RunInChild([] {
+  EXPECT_TRUE(kova_test::RunInChild([] {
     kova_fake::FailLogClean(true);
     if (getuid() == 0) {
       ASSERT_EQ(setresuid(-1, 65534, -1), 0);

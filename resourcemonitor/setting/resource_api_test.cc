@@ -7,13 +7,13 @@
 #include <functional>
 #include <optional>
 
-#include "fake/host_call.h"
 #include "fake/kova_fake.h"
+#include "test_support/host_call.h"
 
 namespace {
 
-using kova_fake::CallHandler;
-using kova_fake::ParseJson;
+using kova_test::CallHandler;
+using kova_test::ParseJson;
 using ::testing::ElementsAreArray;
 using ::testing::IsEmpty;
 

@@ -1,8 +1,8 @@
 // A system root of its own for each test: a temporary directory named by
 // KOVA_ROOT while the test runs, removed with everything in it afterwards.
 
-#ifndef KOVA_PLATFORM_SRC_TEST_ROOT_H_
-#define KOVA_PLATFORM_SRC_TEST_ROOT_H_
+#ifndef KOVA_TEST_SUPPORT_TEST_ROOT_H_
+#define KOVA_TEST_SUPPORT_TEST_ROOT_H_
 
 #include <ftw.h>
 #include <gtest/gtest.h>
@@ -15,7 +15,7 @@
 #include <fstream>
 #include <string>
 
-namespace kova {
+namespace kova_test {
 
 class TestRoot {
  public:
@@ -75,6 +75,6 @@ class TestRoot {
   std::string path_;
 };
 
-}  // namespace kova
+}  // namespace kova_test
 
-#endif  // KOVA_PLATFORM_SRC_TEST_ROOT_H_
+#endif  // KOVA_TEST_SUPPORT_TEST_ROOT_H_

@@ -2,8 +2,8 @@
 // it, in a child process with unprivileged effective ids and saved ids 0, over
 // the real platform, and its methods called through its table.
 
-#ifndef KOVA_PLATFORM_E2E_MODULE_HOST_H_
-#define KOVA_PLATFORM_E2E_MODULE_HOST_H_
+#ifndef KOVA_TEST_SUPPORT_MODULE_HOST_H_
+#define KOVA_TEST_SUPPORT_MODULE_HOST_H_
 
 #include <dlfcn.h>
 #include <gtest/gtest.h>
@@ -12,18 +12,18 @@
 #include <functional>
 #include <string>
 
-#include "fake/host_call.h"
-#include "fake/run_in_child.h"
 #include "kova/webapi.h"
+#include "test_support/host_call.h"
+#include "test_support/run_in_child.h"
 
-namespace kova_e2e {
+namespace kova_test {
 
 class ModuleHost {
  public:
   // Runs `body` in a child with the host's ids (1000, saved 0) after loading
   // the module at `path`. True when the child saw no test failure.
   bool Run(const char* path, const std::function<void()>& body) {
-    return kova_fake::RunInChild([&] {
+    return RunInChild([&] {
       ASSERT_EQ(setresgid(1000, 1000, 0), 0);
       ASSERT_EQ(setresuid(1000, 1000, 0), 0);
       void* module = dlopen(path, RTLD_NOW | RTLD_LOCAL);
@@ -40,7 +40,7 @@ class ModuleHost {
                          const std::string& language = "enu") const {
     for (const APITableEntry* row = table_; row != nullptr && row->api != nullptr; ++row) {
       if (std::string(row->api) == api && std::string(row->method) == method) {
-        return kova_fake::CallHandler(row->handler, params, language);
+        return CallHandler(row->handler, params, language);
       }
     }
     ADD_FAILURE() << api << " " << method << " not in the table";
@@ -51,6 +51,6 @@ class ModuleHost {
   const APITableEntry* table_ = nullptr;
 };
 
-}  // namespace kova_e2e
+}  // namespace kova_test
 
-#endif  // KOVA_PLATFORM_E2E_MODULE_HOST_H_
+#endif  // KOVA_TEST_SUPPORT_MODULE_HOST_H_

@@ -1,7 +1,7 @@
 // Test helpers that call a web-API handler the way the host does.
 
-#ifndef KOVA_FAKE_HOST_CALL_H_
-#define KOVA_FAKE_HOST_CALL_H_
+#ifndef KOVA_TEST_SUPPORT_HOST_CALL_H_
+#define KOVA_TEST_SUPPORT_HOST_CALL_H_
 
 #include <json/reader.h>
 #include <json/writer.h>  // prints values in test failures
@@ -12,7 +12,7 @@
 
 #include "kova/webapi.h"
 
-namespace kova_fake {
+namespace kova_test {
 
 // The JSON value written in `text`; throws on malformed JSON, a mistake in the test.
 inline Json::Value ParseJson(const std::string& text) {
@@ -36,6 +36,6 @@ inline KOVA::APIResponse CallHandler(APIHandler handler, const std::string& para
   return response;
 }
 
-}  // namespace kova_fake
+}  // namespace kova_test
 
-#endif  // KOVA_FAKE_HOST_CALL_H_
+#endif  // KOVA_TEST_SUPPORT_HOST_CALL_H_

@@ -1,8 +1,7 @@
-// For tests and benchmarks: recorded /proc files written into a directory,
-// and the performance-event log read back.
+// For tests and benchmarks: recorded /proc files written into a directory.
 
-#ifndef KOVA_DAEMONS_PERFEVENTD_TEST_SUPPORT_H_
-#define KOVA_DAEMONS_PERFEVENTD_TEST_SUPPORT_H_
+#ifndef KOVA_TEST_SUPPORT_RECORDED_PROC_H_
+#define KOVA_TEST_SUPPORT_RECORDED_PROC_H_
 
 #include <sys/types.h>
 
@@ -10,13 +9,9 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 #include <string>
-#include <vector>
 
-#include "kova/log.h"
-
-namespace perfeventd {
+namespace kova_test {
 
 struct FakeProcess {
   pid_t pid = 0;
@@ -52,27 +47,6 @@ inline void WriteSystem(const std::string& dir, uint64_t busy, uint64_t total,
                                   std::to_string(memory_available_kib) + " kB\n");
 }
 
-// Installs `program` as the platform service "kovaperfeventd" in the system
-// root `root` with the script install-service.sh at `script`, run with
-// `options` and its system-log lines appended to the file `log`.
-inline bool InstallDaemonService(const std::string& script, const std::string& root,
-                                 const std::string& program, const std::string& options,
-                                 const std::string& log) {
-  const std::string command = script + " " + root + " /bin/sh -c \"exec " + program + " " +
-                              options + " --log-stderr 2>>" + log + "\"";
-  return std::system(command.c_str()) == 0;
-}
+}  // namespace kova_test
 
-// The performance-event log's records as KOVALogGet1 prints them, without
-// their ids, fetched through the file `scratch`.
-inline std::vector<std::string> LogLines(const std::string& scratch) {
-  std::vector<std::string> lines;
-  if (KOVALogGet1(kLogTypePerfEvent, scratch.c_str(), "enu") != 0) return {"(no log)"};
-  std::ifstream in(scratch);
-  for (std::string line; std::getline(in, line);) lines.push_back(line.substr(line.find('\t') + 1));
-  return lines;
-}
-
-}  // namespace perfeventd
-
-#endif  // KOVA_DAEMONS_PERFEVENTD_TEST_SUPPORT_H_
+#endif  // KOVA_TEST_SUPPORT_RECORDED_PROC_H_

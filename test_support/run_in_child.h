@@ -1,8 +1,8 @@
 // Runs part of a test in a forked child process: for changes that can't be
 // undone (giving up root) or for behaviour of a fresh process.
 
-#ifndef KOVA_FAKE_RUN_IN_CHILD_H_
-#define KOVA_FAKE_RUN_IN_CHILD_H_
+#ifndef KOVA_TEST_SUPPORT_RUN_IN_CHILD_H_
+#define KOVA_TEST_SUPPORT_RUN_IN_CHILD_H_
 
 #include <gtest/gtest.h>
 #include <sys/wait.h>
@@ -11,7 +11,7 @@
 #include <cstdio>
 #include <functional>
 
-namespace kova_fake {
+namespace kova_test {
 
 // Runs `body` in a child and returns true when it ended without a test failure.
 // The child's failures are printed as usual.
@@ -30,6 +30,6 @@ inline bool RunInChild(const std::function<void()>& body) {
   return WIFEXITED(status) && WEXITSTATUS(status) == 0;
 }
 
-}  // namespace kova_fake
+}  // namespace kova_test
 
-#endif  // KOVA_FAKE_RUN_IN_CHILD_H_
+#endif  // KOVA_TEST_SUPPORT_RUN_IN_CHILD_H_

@@ -15,6 +15,7 @@ namespace statd {
 struct MinuteRow {
   std::string series;  // the series id, as the catalog names it
   int64_t minute = 0;  // Unix time of the minute's first second, a multiple of 60
+  int samples = 0;     // how many samples the minute holds (1 to 60 at one a second)
   double avg = 0;
   double min = 0;
   double max = 0;

@@ -17,8 +17,8 @@
 #include <thread>
 #include <vector>
 
+#include "test_support/daemon_service.h"
 #include "test_support/host_call.h"
-#include "test_support/perfevent_daemon.h"
 #include "test_support/test_root.h"
 #include "test_support/webapid.h"
 
@@ -175,7 +175,7 @@ TEST_F(WebApidTest, ServesEveryMethodOfTheModule) {
 TEST_F(WebApidTest, ARuleMadeOverHttpRaisesAWarningFromTheRealDaemon) {
   // The real daemon as the service, on the live /proc, a cycle every 250 ms:
   // its 30 s window takes 1.5 s, with enough clock ticks for a CPU share to show.
-  ASSERT_TRUE(kova_test::InstallDaemonService(KOVA_INSTALL_SERVICE, root_.path(),
+  ASSERT_TRUE(kova_test::InstallDaemonService(KOVA_INSTALL_SERVICE, root_.path(), "kovaperfeventd",
                                               KOVAPERFEVENTD_PATH, "--time-scale 0.05",
                                               root_.Path("/daemon.err")));
   root_.Write("/etc/kova/services/burner.conf",

@@ -1,11 +1,11 @@
 #include "query/query_params.h"
 
 #include <cstddef>
-#include <limits>
 
 namespace {
 
-constexpr Json::Int64 kNoLimit = std::numeric_limits<Json::Int64>::max();
+// The latest time the collector takes, far beyond any clock.
+constexpr Json::Int64 kLatestTime = Json::Int64{1} << 40;
 constexpr size_t kMaxSeriesIdBytes = 256;
 
 // One parameter of a method. A series list counts its ids between `min` and
@@ -26,13 +26,13 @@ constexpr ParamRule kNoParams[] = {
 };
 constexpr ParamRule kRealtimeParams[] = {
     {"series", true, true, 1, 64, 0, nullptr},
-    {"since", false, false, 0, kNoLimit, 0, nullptr},
+    {"since", false, false, 0, kLatestTime, 0, nullptr},
     {nullptr, false, false, 0, 0, 0, nullptr},
 };
 constexpr ParamRule kHistoryParams[] = {
     {"series", true, true, 1, 64, 0, nullptr},
-    {"from", false, true, 0, kNoLimit, 0, nullptr},
-    {"to", false, true, 0, kNoLimit, 0, "from"},       // after "from"
+    {"from", false, true, 0, kLatestTime, 0, nullptr},
+    {"to", false, true, 0, kLatestTime, 0, "from"},    // after "from"
     {"points", false, false, 1, 10000, 600, nullptr},  // points per series
     {nullptr, false, false, 0, 0, 0, nullptr},
 };

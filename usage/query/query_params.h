@@ -3,7 +3,7 @@
 //
 // "series" is a JSON array of 1 to 64 series ids, each a string of 1 to 256
 // bytes (64 of them stay far below the service's 64 KiB request line).
-// "since", "from" and "to" are Unix seconds, at least 0; "points" is 1 to
+// "since", "from" and "to" are Unix seconds from 0 to 2^40; "points" is 1 to
 // 10000. A whole number must come as a JSON number: 60 and 60.0 are taken, 60.5
 // and the text "60" are refused. An optional number left out is sent with its
 // default (since 0, points 600), so that the request says what was asked.

@@ -51,6 +51,7 @@ TEST_F(UsageApiTest, RefusesBadParametersWithoutAskingTheCollector) {
       {usage_realtime_v1, "{" + series + R"(, "since": true})", "since"},
       {usage_realtime_v1, "{" + series + R"(, "since": null})", "since"},
       {usage_realtime_v1, "{" + series + R"(, "since": 1e300})", "since"},
+      {usage_realtime_v1, "{" + series + R"(, "since": 1099511627777})", "since"},  // 2^40 + 1
       {usage_realtime_v1, "{" + series + R"(, "since": 18446744073709551615})", "since"},
       {usage_history_v1, R"({"from": 1, "to": 2})", "series"},
       {usage_history_v1, "{" + series + R"(, "to": 2})", "from"},
@@ -100,6 +101,8 @@ TEST_F(UsageApiTest, SendsOneRequestToTheLocalCollector) {
        R"({"from":1795000000,"points":1,"request":"history",)" + two_sent + R"(,"to":1795086400})"},
       {usage_history_v1, "{" + two + R"(, "from": 5, "to": 6.0, "points": 10000})",
        R"({"from":5,"points":10000,"request":"history",)" + two_sent + R"(,"to":6})"},
+      {usage_history_v1, "{" + two + R"(, "from": 5, "to": 1099511627776})",
+       R"({"from":5,"points":600,"request":"history",)" + two_sent + R"(,"to":1099511627776})"},
   };
   for (const auto& c : cases) {
     kova_fake::Reset();

@@ -5,6 +5,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <optional>
 #include <string>
 #include <thread>
 
@@ -19,7 +20,8 @@ namespace {
 // all when it is null) and keeps the request line it got.
 class Service {
  public:
-  Service(const kova_test::TestRoot& root, const char* reply) {
+  Service(const kova_test::TestRoot& root, std::optional<std::string> reply)
+      : reply_(std::move(reply)) {
     kova::MakeDirectories(root.Path("/run/kova"), 0755);
     const std::string path = root.Path("/run/kova/statd.sock");
     listener_ = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
@@ -28,7 +30,7 @@ class Service {
     snprintf(address.sun_path, sizeof(address.sun_path), "%s", path.c_str());
     EXPECT_EQ(bind(listener_, reinterpret_cast<sockaddr*>(&address), sizeof(address)), 0);
     EXPECT_EQ(listen(listener_, 1), 0);
-    thread_ = std::thread([this, reply] {
+    thread_ = std::thread([this] {
       const int fd = accept(listener_, nullptr, nullptr);
       if (fd < 0) return;
       char buffer[256];
@@ -37,10 +39,12 @@ class Service {
              (got = read(fd, buffer, sizeof(buffer))) > 0) {
         request_.append(buffer, static_cast<size_t>(got));
       }
-      if (reply != nullptr) {
-        EXPECT_EQ(write(fd, reply, strlen(reply)), static_cast<ssize_t>(strlen(reply)));
-      } else {
-        sleep(4);  // longer than the client waits
+      if (!reply_) sleep(4);  // longer than the client waits
+      // A client that refuses a long reply closes before the end of it.
+      for (size_t sent = 0; reply_ && sent < reply_->size();) {
+        const ssize_t wrote = send(fd, reply_->data() + sent, reply_->size() - sent, MSG_NOSIGNAL);
+        if (wrote <= 0) break;
+        sent += static_cast<size_t>(wrote);
       }
       close(fd);
     });
@@ -53,6 +57,7 @@ class Service {
 
  private:
   int listener_ = -1;
+  std::optional<std::string> reply_;
   std::string request_;
   std::thread thread_;
 };
@@ -73,7 +78,7 @@ TEST(TransmitorTest, SendsOneLineAndReadsOneLine) {
   };
   for (const auto& c : cases) {
     kova_test::TestRoot root;
-    Service service(root, c.reply);
+    Service service(root, c.reply ? std::optional<std::string>(c.reply) : std::nullopt);
     Transmitor transmitor("localhost");
     Json::Value request;
     request["request"] = "reload";
@@ -85,6 +90,33 @@ TEST(TransmitorTest, SendsOneLineAndReadsOneLine) {
     EXPECT_EQ(transmitor.GetDataJson(reply), c.get) << c.reply;
     EXPECT_EQ(reply, kova_test::ParseJson(c.data)) << c.reply;
     EXPECT_EQ(service.request(), "{\"request\":\"reload\"}\n");
+  }
+}
+
+// The service may answer up to 16 MiB, newline left out; a longer line is refused.
+TEST(TransmitorTest, TakesReplyLinesUpToTheServicesLimit) {
+  constexpr size_t kLimit = size_t{16} << 20;
+  const struct {
+    size_t length;  // of the reply line, a JSON string, without its newline
+    int transmit;
+  } cases[] = {
+      {(size_t{1} << 20) + 2, 0},
+      {kLimit, 0},
+      {kLimit + 1, -1},
+  };
+  for (const auto& c : cases) {
+    kova_test::TestRoot root;
+    Service service(root, "\"" + std::string(c.length - 2, 'x') + "\"\n");
+    Transmitor transmitor("localhost");
+    ASSERT_EQ(transmitor.Transmit(Json::Value("catalog")), c.transmit) << c.length;
+    Json::Value reply;
+    if (c.transmit != 0) {
+      EXPECT_EQ(QLIBCErrGet(), KOVA_ERR_FORMAT);
+      EXPECT_EQ(transmitor.GetDataJson(reply), -1);
+      continue;
+    }
+    ASSERT_EQ(transmitor.GetDataJson(reply), 0) << c.length;
+    EXPECT_EQ(reply.asString().size(), c.length - 2);
   }
 }
 

@@ -15,8 +15,9 @@ class KOVA_API Transmitor {
   Transmitor(const Transmitor&) = delete;
   Transmitor& operator=(const Transmitor&) = delete;
 
-  // Sends `request` and waits a few seconds for the reply. Returns 0 when a reply
-  // arrived; negative when the service could not be reached or did not answer.
+  // Sends `request` and waits a few seconds for the reply, one line of at most
+  // 16 MiB. Returns 0 when a reply arrived; negative when the service could not
+  // be reached, did not answer in time or its reply line is longer.
   int Transmit(const Json::Value& request);
 
   // Fills `reply` with the reply to the last Transmit. Returns 0 on success;

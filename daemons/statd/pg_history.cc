@@ -122,6 +122,7 @@ void PgHistory::Configure(const HistorySettings& settings) {
   }
   settings_ = checked;
   enabled_ = checked.enabled;
+  minute_days_ = checked.minute_days;
   woken_ = true;
   wake_.notify_all();
 }
@@ -365,11 +366,7 @@ bool PgHistory::Query(const std::vector<std::string>& series, int64_t from, int6
     error = "The history's start must come before its end.";
     return false;
   }
-  int64_t minute_days = 0;
-  {
-    std::lock_guard<std::mutex> lock(mutex_);
-    minute_days = settings_.minute_days;
-  }
+  const int64_t minute_days = minute_days_;
   const QueryPlan plan = PlanQuery(from, to, points, Now() - minute_days * kSecondsPerDay);
   answer.step = plan.step;
   answer.source = plan.hours ? "hour" : "minute";

@@ -104,6 +104,7 @@ class PgHistory : public HistorySink {
   bool prune_due_ = true;
 
   std::atomic<bool> enabled_{false};
+  std::atomic<int> minute_days_{HistorySettings().minute_days};  // for queries
   std::atomic<bool> reachable_{false};
 
   // The writer's own.

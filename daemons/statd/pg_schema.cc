@@ -19,6 +19,7 @@ CREATE TABLE IF NOT EXISTS minute_rows (
   max double precision NOT NULL) PARTITION BY RANGE (time);
 CREATE INDEX IF NOT EXISTS minute_rows_time ON minute_rows USING brin (time)
   WITH (autosummarize = on);
+CREATE INDEX IF NOT EXISTS minute_rows_series_time ON minute_rows (series_id, time);
 CREATE TABLE IF NOT EXISTS hour_rows (
   series_id integer NOT NULL,
   time timestamptz NOT NULL,

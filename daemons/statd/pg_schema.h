@@ -4,7 +4,9 @@
 //   series           name -> small integer id
 //   minute_rows      one row per series and minute   } partitioned by range on
 //   hour_rows        one row per series and hour     } time, one partition per
-//                                                      UTC day, BRIN on time
+//                                                      UTC day; BRIN on time
+//                                                      for roll-ups, B-tree on
+//                                                      (series, time) for queries
 //   written_minutes  the minutes whose rows are in, written in the same
 //                    transaction as the rows, so a replay never doubles them
 //   pending_hours    hours with minutes not yet rolled up into hour_rows

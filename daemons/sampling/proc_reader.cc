@@ -1,4 +1,4 @@
-#include "perfeventd/proc_reader.h"
+#include "sampling/proc_reader.h"
 
 #include <dirent.h>
 #include <errno.h>
@@ -12,7 +12,7 @@
 #include <ctime>
 #include <string_view>
 
-namespace perfeventd {
+namespace sampling {
 namespace {
 
 // Reads at most size - 1 bytes of the file `path` (relative to `dir_fd`) into
@@ -274,4 +274,4 @@ void ProcReader::ReadMounts(Snapshot& snapshot) const {
   snapshot.mounts_read = true;
 }
 
-}  // namespace perfeventd
+}  // namespace sampling

@@ -1,8 +1,8 @@
-// What the daemon learns about rules' objects outside /proc: the recorded
-// process of a started service, the volume of a LUN, display names.
+// What the daemons learn about the objects they measure outside /proc: the
+// recorded process of a started service, the volume of a LUN, display names.
 
-#ifndef KOVA_DAEMONS_PERFEVENTD_OBJECT_DIRECTORY_H_
-#define KOVA_DAEMONS_PERFEVENTD_OBJECT_DIRECTORY_H_
+#ifndef KOVA_DAEMONS_SAMPLING_OBJECT_DIRECTORY_H_
+#define KOVA_DAEMONS_SAMPLING_OBJECT_DIRECTORY_H_
 
 #include <sys/types.h>
 
@@ -14,7 +14,7 @@
 
 #include "src/lun_registry.h"
 
-namespace perfeventd {
+namespace sampling {
 
 // A process as a service's record names it: its id and start time in clock
 // ticks since boot, which tell it from a later process with the same id.
@@ -58,6 +58,6 @@ class SystemDirectory : public ObjectDirectory {
   ino_t luns_inode_ = 0;
 };
 
-}  // namespace perfeventd
+}  // namespace sampling
 
-#endif  // KOVA_DAEMONS_PERFEVENTD_OBJECT_DIRECTORY_H_
+#endif  // KOVA_DAEMONS_SAMPLING_OBJECT_DIRECTORY_H_

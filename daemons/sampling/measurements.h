@@ -1,21 +1,22 @@
-// The resources of rules, measured from two consecutive passes over /proc.
+// The resources of the system, services and block devices, measured from two
+// consecutive passes over /proc.
 //
 // A measurement is a Reading: amount / base is the resource's value in its
 // unit (percent, KiB per second, milliseconds per I/O). Over several cycles
 // the sums of both give the value of the whole stretch, which is how a rule
 // whose period spans several cycles is measured.
 
-#ifndef KOVA_DAEMONS_PERFEVENTD_MEASUREMENTS_H_
-#define KOVA_DAEMONS_PERFEVENTD_MEASUREMENTS_H_
+#ifndef KOVA_DAEMONS_SAMPLING_MEASUREMENTS_H_
+#define KOVA_DAEMONS_SAMPLING_MEASUREMENTS_H_
 
 #include <cstdint>
 #include <optional>
 #include <string>
 #include <vector>
 
-#include "perfeventd/proc_reader.h"
+#include "sampling/proc_reader.h"
 
-namespace perfeventd {
+namespace sampling {
 
 struct Reading {
   double amount = 0;
@@ -75,6 +76,6 @@ class Measurements {
   mutable uint32_t generation_ = 0;
 };
 
-}  // namespace perfeventd
+}  // namespace sampling
 
-#endif  // KOVA_DAEMONS_PERFEVENTD_MEASUREMENTS_H_
+#endif  // KOVA_DAEMONS_SAMPLING_MEASUREMENTS_H_

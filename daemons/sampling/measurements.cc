@@ -1,10 +1,10 @@
-#include "perfeventd/measurements.h"
+#include "sampling/measurements.h"
 
 #include <algorithm>
 
 #include "kova/perfevent.h"
 
-namespace perfeventd {
+namespace sampling {
 namespace {
 
 constexpr char kNoCpu[] = "the CPU counters can't be read";
@@ -177,4 +177,4 @@ Measured Measurements::Disks(const std::vector<const DiskSample*>& now,
   return Of(static_cast<double>(io_ms), static_cast<double>(ios));
 }
 
-}  // namespace perfeventd
+}  // namespace sampling

@@ -1,9 +1,9 @@
-// One pass over /proc (and /sys) per cycle: the counters the daemon measures
-// rules with, read from the directories given (the live ones, or recorded
-// snapshots in tests and benchmarks).
+// One pass over /proc (and /sys) per cycle: the counters the daemons measure
+// with, read from the directories given (the live ones, or recorded snapshots
+// in tests and benchmarks). A pass reads only what its caller needs.
 
-#ifndef KOVA_DAEMONS_PERFEVENTD_PROC_READER_H_
-#define KOVA_DAEMONS_PERFEVENTD_PROC_READER_H_
+#ifndef KOVA_DAEMONS_SAMPLING_PROC_READER_H_
+#define KOVA_DAEMONS_SAMPLING_PROC_READER_H_
 
 #include <sys/types.h>
 
@@ -12,7 +12,7 @@
 #include <string>
 #include <vector>
 
-namespace perfeventd {
+namespace sampling {
 
 // The "cpu" line of stat, in clock ticks summed over all CPUs.
 struct CpuTimes {
@@ -92,6 +92,6 @@ class ProcReader {
 // Parses the text of a <pid>/stat file; false when it is not one.
 bool ParseProcessStat(const char* text, ProcessSample& sample);
 
-}  // namespace perfeventd
+}  // namespace sampling
 
-#endif  // KOVA_DAEMONS_PERFEVENTD_PROC_READER_H_
+#endif  // KOVA_DAEMONS_SAMPLING_PROC_READER_H_

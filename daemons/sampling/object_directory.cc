@@ -1,4 +1,4 @@
-#include "perfeventd/object_directory.h"
+#include "sampling/object_directory.h"
 
 #include <sys/stat.h>
 
@@ -10,7 +10,7 @@
 #include "src/services.h"
 #include "src/system_root.h"
 
-namespace perfeventd {
+namespace sampling {
 namespace {
 
 constexpr char kLunRegistry[] = "/etc/kova/iscsi/luns.json";
@@ -80,4 +80,4 @@ std::string SystemDirectory::DisplayName(int32_t type, const std::string& object
   return description.display_name;
 }
 
-}  // namespace perfeventd
+}  // namespace sampling

@@ -6,7 +6,6 @@
 
 #include "kova/perfevent.h"
 #include "src/atomic_file.h"
-#include "src/conf_file.h"
 #include "src/services.h"
 #include "src/system_root.h"
 
@@ -63,21 +62,7 @@ std::string SystemDirectory::DisplayName(int32_t type, const std::string& object
     }
     return object;
   }
-  if (type != PERFEVENT_TYPE_SERVICE) return object;
-  kova::ServiceDescription description;
-  if (kova::DescribeService(object, description) <= 0) return object;
-  // A package's service without a name of its own goes by the package's name.
-  if (!description.package.empty() && description.display_name == object) {
-    const std::string info = kova::RootPath("/var/packages/" + description.package + "/INFO");
-    std::string name;
-    for (const char* key : {"displayname_enu", "displayname"}) {
-      if (kova::IsPlainName(description.package) && kova::ConfRead(info, key, name) > 0 &&
-          !name.empty()) {
-        return name;
-      }
-    }
-  }
-  return description.display_name;
+  return type == PERFEVENT_TYPE_SERVICE ? kova::ServiceDisplayName(object) : object;
 }
 
 }  // namespace sampling

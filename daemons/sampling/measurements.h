@@ -46,11 +46,15 @@ class Measurements {
   // Moves on to the pass `now`; the pass before becomes the base of rates.
   void Advance(Snapshot now);
   const Snapshot& current() const { return current_; }
+  // The pass before the current one; nullptr until there were two.
+  const Snapshot* previous() const { return have_previous_ ? &previous_ : nullptr; }
 
   // The whole system's `resource`; for I/O, summed over the physical disks.
   Measured System(int32_t resource) const;
   // The process `pid` that started at `start_time` and its descendants.
   Measured Processes(pid_t pid, uint64_t start_time, int32_t resource) const;
+  // Their resident memory in KiB (the reading's amount, over a base of 1).
+  Measured Resident(pid_t pid, uint64_t start_time) const;
   // The block device `major`:`minor`.
   Measured Device(uint32_t major, uint32_t minor, int32_t resource) const;
 
@@ -60,6 +64,12 @@ class Measurements {
  private:
   // The index of `pid` in the current pass, -1 when absent.
   int IndexOf(pid_t pid) const;
+  // The index of the process `pid` that started at `start_time`, or the
+  // problem that it can't be found.
+  int Find(pid_t pid, uint64_t start_time, const char** problem) const;
+  // The CPU ticks since the pass before (`cpu`) or the resident pages of the
+  // process at `root` and its descendants.
+  uint64_t SumTree(int root, bool cpu) const;
   Measured Disks(const std::vector<const DiskSample*>& now,
                  const std::vector<const DiskSample*>& before, int32_t resource) const;
 

@@ -6,11 +6,11 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <cstdio>
-#include <cstdlib>
 #include <cstring>
 #include <ctime>
 #include <string_view>
+
+#include "sampling/proc_text.h"
 
 namespace sampling {
 namespace {
@@ -56,43 +56,6 @@ bool ReadAll(const std::string& path, std::string& text) {
   }
 }
 
-// The "cpu" line: user nice system idle iowait irq softirq steal; guest time is
-// part of user time already.
-bool ParseCpuLine(const char* text, CpuTimes& cpu) {
-  unsigned long long v[8] = {};
-  if (strncmp(text, "cpu ", 4) != 0) return false;
-  const int got = sscanf(text + 4, "%llu %llu %llu %llu %llu %llu %llu %llu", &v[0], &v[1], &v[2],
-                         &v[3], &v[4], &v[5], &v[6], &v[7]);
-  if (got < 4) return false;
-  cpu.total = 0;
-  for (unsigned long long value : v) cpu.total += value;
-  cpu.busy = cpu.total - v[3] - v[4];
-  return true;
-}
-
-// The value in kiB of the meminfo key `key` ("MemTotal:"), 0 when absent.
-uint64_t MemInfoValue(const char* text, const char* key) {
-  const char* at = strstr(text, key);
-  return at != nullptr ? strtoull(at + strlen(key), nullptr, 10) : 0;
-}
-
-// A mount point of mountinfo with its octal escapes (\040 for a blank) undone.
-std::string Unescape(std::string_view text) {
-  std::string out;
-  for (size_t i = 0; i < text.size(); ++i) {
-    const auto octal = [&](size_t at) { return text[at] >= '0' && text[at] <= '7'; };
-    if (text[i] == '\\' && i + 3 < text.size() && text[i + 1] <= '3' && octal(i + 1) &&
-        octal(i + 2) && octal(i + 3)) {
-      out += static_cast<char>((text[i + 1] - '0') * 64 + (text[i + 2] - '0') * 8 +
-                               (text[i + 3] - '0'));
-      i += 3;
-    } else {
-      out += text[i];
-    }
-  }
-  return out;
-}
-
 double MonotonicSeconds() {
   timespec now;
   clock_gettime(CLOCK_MONOTONIC, &now);
@@ -101,77 +64,69 @@ double MonotonicSeconds() {
 
 }  // namespace
 
-bool ParseProcessStat(const char* text, ProcessSample& sample) {
-  // The command name may hold blanks and parentheses; the fields after it don't.
-  const char* p = strrchr(text, ')');
-  if (p == nullptr) return false;
-  char* end = nullptr;
-  sample.pid = static_cast<pid_t>(strtol(text, &end, 10));
-  if (end == text || sample.pid <= 0) return false;
-  ++p;
-  // Fields from the 3rd (state) on; the wanted ones are 4, 14, 15, 22 and 24.
-  for (int field = 3; field <= 24; ++field) {
-    while (*p == ' ') ++p;
-    if (*p == '\0' || *p == '\n') return false;
-    if (field == 4 || field == 14 || field == 15 || field == 22 || field == 24) {
-      const long long value = strtoll(p, &end, 10);
-      if (end == p) return false;
-      switch (field) {
-        case 4:
-          sample.ppid = static_cast<pid_t>(value);
-          break;
-        case 14:
-          sample.ticks = static_cast<uint64_t>(value);
-          break;
-        case 15:
-          sample.ticks += static_cast<uint64_t>(value);
-          break;
-        case 22:
-          sample.start_time = static_cast<uint64_t>(value);
-          break;
-        default:
-          sample.rss_pages = value > 0 ? static_cast<uint64_t>(value) : 0;
-          break;
-      }
-      p = end;
-    } else {
-      while (*p != ' ' && *p != '\0') ++p;
-    }
-  }
-  return true;
-}
-
 ProcReader::ProcReader(std::string proc_dir, std::string sys_dir)
     : proc_(std::move(proc_dir)), sys_(std::move(sys_dir)) {}
 
 Snapshot ProcReader::Read(const SampleNeeds& needs) const {
   Snapshot snapshot;
   snapshot.seconds = MonotonicSeconds();
-  char buffer[8192];
-  const std::string stat = proc_ + "/stat";
-  CpuTimes cpu;
-  if (ReadSmall(AT_FDCWD, stat.c_str(), buffer, sizeof(buffer)) > 0 && ParseCpuLine(buffer, cpu)) {
-    snapshot.cpu = cpu;
-  } else {
-    snapshot.unreadable.push_back(stat);
-  }
-  const std::string meminfo = proc_ + "/meminfo";
-  if (ReadSmall(AT_FDCWD, meminfo.c_str(), buffer, sizeof(buffer)) > 0 &&
-      (snapshot.memory_total_kib = MemInfoValue(buffer, "MemTotal:")) > 0) {
-    snapshot.memory_available_kib = MemInfoValue(buffer, "MemAvailable:");
-    if (strstr(buffer, "MemAvailable:") == nullptr) {  // kernels before 3.14
-      snapshot.memory_available_kib = MemInfoValue(buffer, "MemFree:") +
-                                      MemInfoValue(buffer, "Buffers:") +
-                                      MemInfoValue(buffer, "Cached:");
-    }
-  } else {
-    snapshot.memory_total_kib = 0;
-    snapshot.unreadable.push_back(meminfo);
-  }
+  ReadStat(snapshot, needs.cpu_states);
+  ReadMemory(snapshot, needs.memory_detail);
+  if (needs.load) ReadLoad(snapshot);
   if (needs.processes) ReadProcesses(snapshot);
-  if (needs.disks) ReadDisks(snapshot, needs.whole_disks);
+  if (needs.disks) ReadDisks(snapshot, needs.whole_disks, needs.disk_detail);
   if (needs.mounts) ReadMounts(snapshot);
+  if (needs.net) ReadNet(snapshot);
   return snapshot;
+}
+
+void ProcReader::ReadStat(Snapshot& snapshot, bool cpu_states) const {
+  const std::string path = proc_ + "/stat";
+  CpuTimes cpu;
+  if (cpu_states) {
+    // The whole file: with many CPUs their lines outgrow a small buffer.
+    std::string text;
+    if (ReadAll(path, text) && ParseCpuLine(text.c_str(), cpu) &&
+        ParseCpuStates(text.c_str(), snapshot.cpu_states)) {
+      snapshot.cpu = cpu;
+      return;
+    }
+    snapshot.cpu_states.clear();
+  } else {
+    char buffer[8192];
+    if (ReadSmall(AT_FDCWD, path.c_str(), buffer, sizeof(buffer)) > 0 &&
+        ParseCpuLine(buffer, cpu)) {
+      snapshot.cpu = cpu;
+      return;
+    }
+  }
+  snapshot.unreadable.push_back(path);
+}
+
+void ProcReader::ReadMemory(Snapshot& snapshot, bool detail) const {
+  const std::string path = proc_ + "/meminfo";
+  char buffer[8192];
+  if (ReadSmall(AT_FDCWD, path.c_str(), buffer, sizeof(buffer)) > 0 &&
+      ParseMemoryTotals(buffer, snapshot.memory_total_kib, snapshot.memory_available_kib)) {
+    MemoryDetail memory;
+    if (detail && ParseMemoryDetail(buffer, memory)) snapshot.memory_detail = memory;
+    return;
+  }
+  snapshot.memory_total_kib = 0;
+  snapshot.memory_available_kib = 0;
+  snapshot.unreadable.push_back(path);
+}
+
+void ProcReader::ReadLoad(Snapshot& snapshot) const {
+  const std::string path = proc_ + "/loadavg";
+  char buffer[256];
+  LoadAverage load;
+  if (ReadSmall(AT_FDCWD, path.c_str(), buffer, sizeof(buffer)) > 0 &&
+      ParseLoadAverage(buffer, load)) {
+    snapshot.load = load;
+  } else {
+    snapshot.unreadable.push_back(path);
+  }
 }
 
 void ProcReader::ReadProcesses(Snapshot& snapshot) const {
@@ -201,7 +156,7 @@ void ProcReader::ReadProcesses(Snapshot& snapshot) const {
   snapshot.processes_read = true;
 }
 
-void ProcReader::ReadDisks(Snapshot& snapshot, bool whole_disks) const {
+void ProcReader::ReadDisks(Snapshot& snapshot, bool whole_disks, bool detail) const {
   const std::string path = proc_ + "/diskstats";
   std::string text;
   if (!ReadAll(path, text)) {
@@ -214,20 +169,11 @@ void ProcReader::ReadDisks(Snapshot& snapshot, bool whole_disks) const {
   for (size_t start = 0; start < text.size();) {
     size_t end = text.find('\n', start);
     if (end == std::string::npos) end = text.size();
-    const std::string line = text.substr(start, end - start);
-    start = end + 1;
+    text[end] = '\0';  // one line at a time; the terminating NUL stands for the last one's end
     DiskSample disk;
-    char name[128];
-    unsigned long long reads, read_sectors, read_ms, writes, write_sectors, write_ms;
-    if (sscanf(line.c_str(), "%u %u %127s %llu %*u %llu %llu %llu %*u %llu %llu", &disk.major,
-               &disk.minor, name, &reads, &read_sectors, &read_ms, &writes, &write_sectors,
-               &write_ms) != 9) {
-      continue;
-    }
-    disk.name = name;
-    disk.ios = reads + writes;
-    disk.sectors = read_sectors + write_sectors;
-    disk.io_ms = read_ms + write_ms;
+    const bool parsed = ParseDiskLine(text.c_str() + start, detail, disk);
+    start = end + 1;
+    if (!parsed) continue;
     if (block >= 0) {
       // /sys names a disk with '/' in its name with '!' instead; a physical
       // disk has a device behind it, a partition or a virtual device has none.
@@ -251,27 +197,24 @@ void ProcReader::ReadMounts(Snapshot& snapshot) const {
   for (size_t start = 0; start < text.size();) {
     size_t end = text.find('\n', start);
     if (end == std::string::npos) end = text.size();
-    std::string_view line(text.data() + start, end - start);
-    start = end + 1;
-    // id parent major:minor root mount-point ...
-    std::string_view fields[5];
-    size_t at = 0;
-    int count = 0;
-    while (count < 5 && at < line.size()) {
-      size_t blank = line.find(' ', at);
-      if (blank == std::string_view::npos) blank = line.size();
-      fields[count++] = line.substr(at, blank - at);
-      at = blank + 1;
-    }
     MountPoint mount;
-    if (count < 5 ||
-        sscanf(std::string(fields[2]).c_str(), "%u:%u", &mount.major, &mount.minor) != 2) {
-      continue;
+    if (ParseMountLine(std::string_view(text.data() + start, end - start), mount)) {
+      snapshot.mounts.push_back(std::move(mount));
     }
-    mount.path = Unescape(fields[4]);
-    snapshot.mounts.push_back(std::move(mount));
+    start = end + 1;
   }
   snapshot.mounts_read = true;
+}
+
+void ProcReader::ReadNet(Snapshot& snapshot) const {
+  const std::string path = proc_ + "/net/dev";
+  std::string text;
+  if (!ReadAll(path, text)) {
+    snapshot.unreadable.push_back(path);
+    return;
+  }
+  ParseNetDev(text.c_str(), snapshot.net);
+  snapshot.net_read = true;
 }
 
 }  // namespace sampling

@@ -126,7 +126,7 @@ Measured Monitor::Measure(const Rule& rule, const Measurements& measurements) {
     case PERFEVENT_TYPE_SERVICE:
       return MeasureService(rule.object, rule.resource, measurements);
     case PERFEVENT_TYPE_ISCSI_LUN:
-      return MeasureLun(rule.object, rule.resource, measurements);
+      return sampling::MeasureLun(directory_, measurements, rule.object, rule.resource);
     default:
       return measurements.System(rule.resource);
   }
@@ -139,19 +139,6 @@ Measured Monitor::MeasureService(const std::string& name, int32_t resource,
   Measured result = measurements.Processes(process->pid, process->start_time, resource);
   if (result.problem == "its process is gone") result.problem = "the service is not running";
   return result;
-}
-
-Measured Monitor::MeasureLun(const std::string& uuid, int32_t resource,
-                             const Measurements& measurements) {
-  const std::optional<std::string> volume = directory_.LunVolume(uuid);
-  if (!volume) return Measured{std::nullopt, "no LUN has this uuid"};
-  if (volume->empty()) return Measured{std::nullopt, "the LUN names no volume"};
-  const sampling::Snapshot& snapshot = measurements.current();
-  if (!snapshot.mounts_read) return Measured{std::nullopt, "the mounts can't be read"};
-  const sampling::MountPoint* holder =
-      sampling::MountHolding(snapshot.mounts, directory_.RealPath(*volume));
-  if (holder == nullptr) return Measured{std::nullopt, "no mount holds its volume " + *volume};
-  return measurements.Device(holder->major, holder->minor, resource);
 }
 
 void Monitor::Say(RuleState& state, const std::string& problem) {

@@ -61,8 +61,6 @@ class Monitor {
   sampling::Measured Measure(const Rule& rule, const sampling::Measurements& measurements);
   sampling::Measured MeasureService(const std::string& name, int32_t resource,
                                     const sampling::Measurements& measurements);
-  sampling::Measured MeasureLun(const std::string& uuid, int32_t resource,
-                                const sampling::Measurements& measurements);
   // Says `problem` of the rule unless it was said last; an empty problem says
   // that a rule with a problem said is measured again.
   void Say(RuleState& state, const std::string& problem);

@@ -28,6 +28,7 @@ Measurements::Measurements(uint64_t page_kib) : page_kib_(page_kib) {}
 
 void Measurements::Advance(Snapshot now) {
   have_previous_ = true;
+  ++passes_;
   previous_ = std::move(current_);
   current_ = std::move(now);
   const std::vector<ProcessSample>& processes = current_.processes;

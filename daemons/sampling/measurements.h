@@ -47,7 +47,7 @@ class Measurements {
   void Advance(Snapshot now);
   const Snapshot& current() const { return current_; }
   // The pass before the current one; nullptr until there were two.
-  const Snapshot* previous() const { return have_previous_ ? &previous_ : nullptr; }
+  const Snapshot* previous() const { return passes_ >= 2 ? &previous_ : nullptr; }
 
   // The whole system's `resource`; for I/O, summed over the physical disks.
   Measured System(int32_t resource) const;
@@ -75,6 +75,7 @@ class Measurements {
 
   uint64_t page_kib_;
   bool have_previous_ = false;
+  uint64_t passes_ = 0;
   Snapshot previous_;
   Snapshot current_;
   bool deltas_ = false;                // whether `delta_ticks_` could be worked out

@@ -23,4 +23,16 @@ const MountPoint* MountHolding(const std::vector<MountPoint>& mounts, const std:
   return holder;
 }
 
+Measured MeasureLun(ObjectDirectory& directory, const Measurements& measurements,
+                    const std::string& uuid, int32_t resource) {
+  const std::optional<std::string> volume = directory.LunVolume(uuid);
+  if (!volume) return Measured{std::nullopt, "no LUN has this uuid"};
+  if (volume->empty()) return Measured{std::nullopt, "the LUN names no volume"};
+  const Snapshot& snapshot = measurements.current();
+  if (!snapshot.mounts_read) return Measured{std::nullopt, "the mounts can't be read"};
+  const MountPoint* holder = MountHolding(snapshot.mounts, directory.RealPath(*volume));
+  if (holder == nullptr) return Measured{std::nullopt, "no mount holds its volume " + *volume};
+  return measurements.Device(holder->major, holder->minor, resource);
+}
+
 }  // namespace sampling

@@ -50,6 +50,9 @@ class SystemDirectory : public ObjectDirectory {
   std::string RealPath(const std::string& path) override;
   std::string DisplayName(int32_t type, const std::string& object) override;
 
+  // The LUNs of the registry as the last Refresh read it.
+  const std::vector<kova::Lun>& luns() const { return luns_; }
+
  private:
   // The LUN registry as last read, and the change time of its file then.
   std::vector<kova::Lun> luns_;

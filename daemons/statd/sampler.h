@@ -5,7 +5,10 @@
 #ifndef KOVA_DAEMONS_STATD_SAMPLER_H_
 #define KOVA_DAEMONS_STATD_SAMPLER_H_
 
+#include <sys/statvfs.h>
+
 #include <chrono>
+#include <functional>
 #include <memory>
 #include <string>
 #include <utility>
@@ -38,6 +41,12 @@ struct SamplerOptions {
   // How long a volume's statvfs may take before the cycle goes on without
   // that volume; a volume whose last call hasn't come back is skipped.
   std::chrono::milliseconds volume_timeout{200};
+  // The call that reads a volume's space, statvfs(2) when empty; tests put one
+  // that hangs. Called on helper threads, possibly after the sampler is gone.
+  std::function<int(const char* path, struct statvfs* out)> statvfs;
+  // Monotonic seconds, over which rates are worked out: the time of each pass
+  // over /proc when empty; tests put their own.
+  std::function<double()> clock;
 };
 
 class Sampler {

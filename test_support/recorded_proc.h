@@ -67,9 +67,10 @@ struct FakeCpu {
 inline void WriteCpuStat(const std::string& dir, const std::vector<FakeCpu>& cpus) {
   std::string text;
   for (const FakeCpu& c : cpus) {
-    text += (c.cpu < 0 ? std::string("cpu ") : "cpu" + std::to_string(c.cpu));
+    text += "cpu";
+    text += c.cpu < 0 ? std::string(" ") : std::to_string(c.cpu);
     for (uint64_t ticks : {c.user, c.nice, c.system, c.idle, c.iowait, c.irq, c.softirq, c.steal}) {
-      text += " " + std::to_string(ticks);
+      text.append(" ").append(std::to_string(ticks));
     }
     text += " 0 0\n";
   }
@@ -215,8 +216,8 @@ inline void WriteMachineCounters(const std::string& root, const RecordedMachine&
   std::vector<FakeInterface> interfaces = {
       {"lo", 5000 * pass, 50 * pass, 0, 5000 * pass, 50 * pass, 0}};
   for (int i = 0; i < shape.interfaces; ++i) {
-    interfaces.push_back(
-        {"eth" + std::to_string(i), 125000 * pass, 100 * pass, 0, 62500 * pass, 80 * pass, 0});
+    interfaces.push_back({std::string("eth").append(std::to_string(i)), 125000 * pass, 100 * pass,
+                          0, 62500 * pass, 80 * pass, 0});
   }
   WriteNetDev(proc, interfaces);
 }

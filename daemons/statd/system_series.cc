@@ -77,7 +77,7 @@ void AddCpu(const CpuStates& before, const CpuStates& now, std::vector<SeriesVal
     total += now.*field - before.*field;
   }
   if (total == 0) return;
-  const std::string object = now.cpu < 0 ? "" : "cpu" + std::to_string(now.cpu);
+  const std::string object = now.cpu < 0 ? "" : std::string("cpu").append(std::to_string(now.cpu));
   const Labels labels = now.cpu < 0 ? Labels{} : Labels{{"cpu", std::to_string(now.cpu)}};
   for (const CpuMetric* row = kCpuMetrics; row->metric != nullptr; ++row) {
     uint64_t ticks = 0;

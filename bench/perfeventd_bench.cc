@@ -19,10 +19,10 @@
 #include <vector>
 
 #include "kova/perfevent.h"
-#include "perfeventd/measurements.h"
 #include "perfeventd/monitor.h"
-#include "perfeventd/object_directory.h"
-#include "perfeventd/proc_reader.h"
+#include "sampling/measurements.h"
+#include "sampling/object_directory.h"
+#include "sampling/proc_reader.h"
 #include "test_support/recorded_proc.h"
 
 namespace perfeventd {
@@ -30,6 +30,9 @@ namespace perfeventd {
 using kova_test::WriteFile;
 using kova_test::WriteProcess;
 using kova_test::WriteSystem;
+using sampling::Measurements;
+using sampling::ProcReader;
+using sampling::SystemDirectory;
 namespace {
 
 constexpr int kServices = 250;  // each one process; the first 50 have a child too

@@ -12,14 +12,19 @@
 #include <vector>
 
 #include "perfeventd/event_queue.h"
-#include "perfeventd/measurements.h"
 #include "perfeventd/monitor.h"
-#include "perfeventd/object_directory.h"
-#include "perfeventd/proc_reader.h"
 #include "perfeventd/rule_loader.h"
+#include "sampling/measurements.h"
+#include "sampling/object_directory.h"
+#include "sampling/proc_reader.h"
 #include "src/system_root.h"
 
 namespace perfeventd {
+
+using sampling::Measurements;
+using sampling::ProcReader;
+using sampling::Snapshot;
+using sampling::SystemDirectory;
 namespace {
 
 constexpr char kSpillPath[] = "/var/lib/kova/perfevent/waiting_events";

@@ -7,8 +7,14 @@
 #include <unordered_set>
 
 #include "kova/perfevent.h"
+#include "sampling/mounts.h"
 
 namespace perfeventd {
+
+using sampling::Measured;
+using sampling::Measurements;
+using sampling::Reading;
+using sampling::SampleNeeds;
 namespace {
 
 constexpr int kDefaultCycleSeconds = 5;
@@ -17,17 +23,10 @@ bool IsIo(int32_t resource) {
   return resource == PERFEVENT_RESOURCE_IO_RATE || resource == PERFEVENT_RESOURCE_IO_LATENCY;
 }
 
-// Whether `path` is `mount` or lies below it.
-bool IsUnder(const std::string& path, const std::string& mount) {
-  if (mount == "/") return !path.empty() && path[0] == '/';
-  return path.compare(0, mount.size(), mount) == 0 &&
-         (path.size() == mount.size() || path[mount.size()] == '/');
-}
-
 }  // namespace
 
-Monitor::Monitor(ObjectDirectory& directory, Notify notify)
-    : directory_(directory), notify_(std::move(notify)) {}
+Monitor::Monitor(sampling::ObjectDirectory& directory, Notify notify)
+    : directory_(directory), notify_(std::move(notify)), services_(directory) {}
 
 void Monitor::SetRules(const std::vector<Rule>& rules) {
   std::unordered_map<std::string, size_t> old_index;
@@ -60,7 +59,7 @@ void Monitor::SetRules(const std::vector<Rule>& rules) {
   for (const RuleState& state : states_) {
     if (state.rule.type == PERFEVENT_TYPE_SERVICE) watched.insert(state.rule.object);
   }
-  std::erase_if(processes_, [&](const auto& entry) { return !watched.count(entry.first); });
+  services_.KeepOnly(watched);
   cycle_seconds_ = cycle > 0 ? cycle : kDefaultCycleSeconds;
   for (RuleState& state : states_) {
     const int per_sample = state.rule.period / cycle_seconds_;
@@ -127,7 +126,7 @@ Measured Monitor::Measure(const Rule& rule, const Measurements& measurements) {
     case PERFEVENT_TYPE_SERVICE:
       return MeasureService(rule.object, rule.resource, measurements);
     case PERFEVENT_TYPE_ISCSI_LUN:
-      return MeasureLun(rule.object, rule.resource, measurements);
+      return sampling::MeasureLun(directory_, measurements, rule.object, rule.resource);
     default:
       return measurements.System(rule.resource);
   }
@@ -135,40 +134,11 @@ Measured Monitor::Measure(const Rule& rule, const Measurements& measurements) {
 
 Measured Monitor::MeasureService(const std::string& name, int32_t resource,
                                  const Measurements& measurements) {
-  auto known = processes_.find(name);
-  // The record is read again only when the process last known is gone.
-  if (known == processes_.end() ||
-      !measurements.HasProcess(known->second.pid, known->second.start_time)) {
-    const std::optional<RecordedProcess> recorded = directory_.ServiceProcess(name);
-    if (!recorded) {
-      if (known != processes_.end()) processes_.erase(known);
-      return Measured{std::nullopt, "the service is not running"};
-    }
-    known = processes_.insert_or_assign(name, *recorded).first;
-  }
-  Measured result = measurements.Processes(known->second.pid, known->second.start_time, resource);
+  const std::optional<sampling::RecordedProcess> process = services_.Find(name, measurements);
+  if (!process) return Measured{std::nullopt, "the service is not running"};
+  Measured result = measurements.Processes(process->pid, process->start_time, resource);
   if (result.problem == "its process is gone") result.problem = "the service is not running";
   return result;
-}
-
-Measured Monitor::MeasureLun(const std::string& uuid, int32_t resource,
-                             const Measurements& measurements) {
-  const std::optional<std::string> volume = directory_.LunVolume(uuid);
-  if (!volume) return Measured{std::nullopt, "no LUN has this uuid"};
-  if (volume->empty()) return Measured{std::nullopt, "the LUN names no volume"};
-  const Snapshot& snapshot = measurements.current();
-  if (!snapshot.mounts_read) return Measured{std::nullopt, "the mounts can't be read"};
-  // The device of the deepest mount that holds the volume.
-  const std::string path = directory_.RealPath(*volume);
-  const MountPoint* holder = nullptr;
-  for (const MountPoint& mount : snapshot.mounts) {
-    if (IsUnder(path, mount.path) &&
-        (holder == nullptr || mount.path.size() >= holder->path.size())) {
-      holder = &mount;
-    }
-  }
-  if (holder == nullptr) return Measured{std::nullopt, "no mount holds its volume " + *volume};
-  return measurements.Device(holder->major, holder->minor, resource);
 }
 
 void Monitor::Say(RuleState& state, const std::string& problem) {

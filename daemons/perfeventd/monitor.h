@@ -8,15 +8,15 @@
 
 #include <cstdint>
 #include <functional>
-#include <map>
 #include <string>
 #include <vector>
 
 #include "perfeventd/event_text.h"
-#include "perfeventd/measurements.h"
-#include "perfeventd/object_directory.h"
 #include "perfeventd/rule.h"
 #include "perfeventd/rule_window.h"
+#include "sampling/measurements.h"
+#include "sampling/object_directory.h"
+#include "sampling/service_processes.h"
 
 namespace perfeventd {
 
@@ -25,7 +25,7 @@ using Notify = std::function<void(int priority, const std::string& text)>;
 
 class Monitor {
  public:
-  Monitor(ObjectDirectory& directory, Notify notify);
+  Monitor(sampling::ObjectDirectory& directory, Notify notify);
 
   // Replaces the rules. A rule whose id and fields are unchanged keeps its
   // window; a new, changed or switched-on rule starts a fresh one.
@@ -35,12 +35,12 @@ class Monitor {
   // periods, so that every rule is sampled on time; 5 without rules.
   int CycleSeconds() const { return cycle_seconds_; }
   // What the pass over /proc of each cycle must read for these rules.
-  SampleNeeds Needs() const;
+  sampling::SampleNeeds Needs() const;
   size_t rule_count() const { return states_.size(); }
 
   // Runs one cycle over `measurements`, which were advanced to this cycle's
   // pass, and returns the events decided, stamped `now`.
-  std::vector<Event> Cycle(const Measurements& measurements, int64_t now);
+  std::vector<Event> Cycle(const sampling::Measurements& measurements, int64_t now);
 
  private:
   struct RuleState {
@@ -52,25 +52,24 @@ class Monitor {
     std::string key;            // the object and resource: rules that share it share a measurement
     std::string fixed_problem;  // why the rule can never be measured, empty when it can
     int cycles_per_sample = 1;
-    int cycles = 0;        // cycles of the sample being gathered
-    Reading sum;           // their readings
-    bool missing = false;  // whether one of them had none
-    std::string said;      // the problem last said of the rule, empty when none
+    int cycles = 0;         // cycles of the sample being gathered
+    sampling::Reading sum;  // their readings
+    bool missing = false;   // whether one of them had none
+    std::string said;       // the problem last said of the rule, empty when none
   };
 
-  Measured Measure(const Rule& rule, const Measurements& measurements);
-  Measured MeasureService(const std::string& name, int32_t resource,
-                          const Measurements& measurements);
-  Measured MeasureLun(const std::string& uuid, int32_t resource, const Measurements& measurements);
+  sampling::Measured Measure(const Rule& rule, const sampling::Measurements& measurements);
+  sampling::Measured MeasureService(const std::string& name, int32_t resource,
+                                    const sampling::Measurements& measurements);
   // Says `problem` of the rule unless it was said last; an empty problem says
   // that a rule with a problem said is measured again.
   void Say(RuleState& state, const std::string& problem);
 
-  ObjectDirectory& directory_;
+  sampling::ObjectDirectory& directory_;
   Notify notify_;
   std::vector<RuleState> states_;  // in the store's order
   int cycle_seconds_ = 5;
-  std::map<std::string, RecordedProcess> processes_;  // the last known process of each service
+  sampling::ServiceProcesses services_;
 };
 
 }  // namespace perfeventd

@@ -9,6 +9,12 @@
 #include "kova/perfevent.h"
 
 namespace perfeventd {
+
+using sampling::CpuTimes;
+using sampling::Measurements;
+using sampling::ObjectDirectory;
+using sampling::RecordedProcess;
+using sampling::Snapshot;
 namespace {
 
 using ::testing::ElementsAre;

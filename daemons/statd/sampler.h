@@ -5,7 +5,10 @@
 #ifndef KOVA_DAEMONS_STATD_SAMPLER_H_
 #define KOVA_DAEMONS_STATD_SAMPLER_H_
 
+#include <sys/statvfs.h>
+
 #include <chrono>
+#include <functional>
 #include <memory>
 #include <string>
 #include <utility>
@@ -38,6 +41,12 @@ struct SamplerOptions {
   // How long a volume's statvfs may take before the cycle goes on without
   // that volume; a volume whose last call hasn't come back is skipped.
   std::chrono::milliseconds volume_timeout{200};
+  // The call that reads a volume's space, statvfs(2) when empty; tests put one
+  // that hangs. Called on helper threads, possibly after the sampler is gone.
+  std::function<int(const char* path, struct statvfs* out)> statvfs;
+  // Monotonic seconds, over which rates are worked out: the time of each pass
+  // over /proc when empty; tests put their own.
+  std::function<double()> clock;
 };
 
 class Sampler {
@@ -45,14 +54,20 @@ class Sampler {
   virtual ~Sampler() = default;
 
   // One pass. Returns the value of every series that has one in this cycle, in
-  // the catalog's order: a rate needs the pass before (so the first cycle gives
-  // only levels), and a counter that went back (wrapped or reset), an object
-  // that vanished or a file that can't be read gives no value. Never blocks
-  // longer than the volume timeout on a hung mount.
+  // the catalog's order (CPU, load, memory, interfaces, disks, volumes,
+  // services, LUNs; each object's metrics together, objects in the order their
+  // files list them, services by name): a rate needs the pass before (so the
+  // first cycle gives only levels), and a counter that went back (wrapped or
+  // reset), an object that vanished or a file that can't be read gives no
+  // value. An interface, disk or CPU that appears, or a CPU back online, has
+  // values from its second pass on. disk.await and lun.latency have no value
+  // in a cycle without I/O, so that idle seconds don't pull an average down.
+  // Never blocks longer than the volume timeout on a hung mount.
   virtual std::vector<SeriesValue> Cycle() = 0;
 
-  // The files and volumes that couldn't be read in the last cycle, so that the
-  // daemon can say each once.
+  // The files and volumes (real paths) that couldn't be read in the last
+  // cycle, a volume also while its statvfs hangs, so that the daemon can say
+  // each once.
   virtual const std::vector<std::string>& Unreadable() const = 0;
 };
 

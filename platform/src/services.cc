@@ -26,6 +26,7 @@ namespace {
 
 constexpr char kServicesDir[] = "/etc/kova/services/";
 constexpr char kRunDir[] = "/run/kova";
+constexpr char kPackagesDir[] = "/var/packages/";
 constexpr char kPackagePrefix[] = "pkgctl-";
 constexpr auto kStopGrace = std::chrono::milliseconds(5000);
 
@@ -133,7 +134,7 @@ int DescribeService(const std::string& name, ServiceDescription& description) {
   if (access(path.c_str(), F_OK) != 0) {
     const std::string package = name.substr(std::min(name.size(), sizeof(kPackagePrefix) - 1));
     if (name.rfind(kPackagePrefix, 0) == 0 && !package.empty() &&
-        IsDirectory(RootPath("/var/packages/" + package))) {
+        IsDirectory(RootPath(kPackagesDir + package))) {
       description.package = package;
       return 1;
     }
@@ -164,6 +165,38 @@ std::vector<std::string> ListServices() {
   closedir(dir);
   std::sort(names.begin(), names.end());
   return names;
+}
+
+std::vector<std::string> ListKnownServices() {
+  std::vector<std::string> names = ListServices();
+  const std::string packages = RootPath(kPackagesDir);
+  DIR* dir = opendir(packages.c_str());
+  if (dir == nullptr) return names;
+  while (const dirent* entry = readdir(dir)) {
+    const std::string name = kPackagePrefix + std::string(entry->d_name);
+    const bool directory = entry->d_type == DT_DIR ||
+                           (entry->d_type == DT_UNKNOWN && IsDirectory(packages + entry->d_name));
+    if (directory && IsPlainName(entry->d_name) && IsPlainName(name)) names.push_back(name);
+  }
+  closedir(dir);
+  std::sort(names.begin(), names.end());
+  names.erase(std::unique(names.begin(), names.end()), names.end());
+  return names;
+}
+
+std::string ServiceDisplayName(const std::string& name) {
+  ServiceDescription description;
+  if (DescribeService(name, description) <= 0) return name;
+  if (description.package.empty() || description.display_name != name ||
+      !IsPlainName(description.package)) {
+    return description.display_name;
+  }
+  const std::string info = RootPath(kPackagesDir + description.package + "/INFO");
+  std::string package_name;
+  for (const char* key : {"displayname_enu", "displayname"}) {
+    if (ConfRead(info, key, package_name) > 0 && !package_name.empty()) return package_name;
+  }
+  return description.display_name;
 }
 
 }  // namespace kova

@@ -34,6 +34,18 @@ int DescribeService(const std::string& name, ServiceDescription& description);
 // The names of the described services, sorted.
 std::vector<std::string> ListServices();
 
+// The names of every service the system knows, sorted, each once: the
+// described ones and "pkgctl-<pkg>" for each installed package (a directory
+// /var/packages/<pkg>), with or without a description. Empty when neither
+// directory can be read.
+std::vector<std::string> ListKnownServices();
+
+// The name users see for the service `name`: its display name, or for a
+// package's service without one of its own, the package's name from its INFO
+// file (displayname_enu, else displayname). `name` itself when the service is
+// unknown or its description can't be read.
+std::string ServiceDisplayName(const std::string& name);
+
 }  // namespace kova
 
 #endif  // KOVA_PLATFORM_SRC_SERVICES_H_

@@ -137,6 +137,32 @@ TEST_F(ServicesTest, DisplayNames) {
   EXPECT_EQ(kova::ListServices(), (std::vector<std::string>{"demo", "plain"}));
 }
 
+TEST_F(ServicesTest, KnownServicesWithPackagesAndTheNamesUsersSee) {
+  root_.Write("/var/packages/Photos/INFO", "displayname=\"Photo Station\"\n");
+  root_.Write("/var/packages/Media/INFO",
+              "displayname=\"Media\"\ndisplayname_enu=\"Media Server\"\n");
+  kova::MakeDirectories(root_.Path("/var/packages/Bare"), 0755);
+  kova::MakeDirectories(root_.Path("/var/packages/.hidden"), 0755);
+  root_.Write("/var/packages/file", "");
+  root_.Write("/etc/kova/services/pkgctl-Media.conf", "package=\"Media\"\n");
+  root_.Write("/etc/kova/services/pkgctl-Photos.conf",
+              "package=\"Photos\"\ndisplay_name=\"Photos (own name)\"\n");
+  EXPECT_EQ(kova::ListKnownServices(),
+            (std::vector<std::string>{"demo", "pkgctl-Bare", "pkgctl-Media", "pkgctl-Photos"}));
+  const struct {
+    const char* name;
+    const char* display;
+  } cases[] = {
+      {"demo", "Demo service"},
+      {"pkgctl-Media", "Media Server"},
+      {"pkgctl-Photos", "Photos (own name)"},
+      {"pkgctl-Bare", "pkgctl-Bare"},
+      {"unknown", "unknown"},
+      {"../demo", "../demo"},
+  };
+  for (const auto& c : cases) EXPECT_EQ(kova::ServiceDisplayName(c.name), c.display) << c.name;
+}
+
 // A process that ignores SIGTERM is killed once the grace time is over.
 TEST(ServiceProcessTest, TerminateKillsWhatIgnoresTerm) {
   TestRoot root;

@@ -1,9 +1,15 @@
-// Shared folders: /var/services/<link> is a symbolic link into a volume.
+// Volumes, and shared folders: /var/services/<link> is a symbolic link into a volume.
 
+#include "src/volumes.h"
+
+#include <dirent.h>
+#include <fcntl.h>
 #include <limits.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <cstdlib>
 #include <cstring>
 #include <string>
 
@@ -32,7 +38,48 @@ std::string Normalize(const std::string& path) {
   return out.empty() ? "/" : out;
 }
 
+// The N of a directory entry named "volume<N>", 0 when it names no volume.
+// Leading zeros are refused, so that one number names one volume.
+unsigned long VolumeNumber(const char* name) {
+  constexpr char kPrefix[] = "volume";
+  if (strncmp(name, kPrefix, sizeof(kPrefix) - 1) != 0) return 0;
+  const char* digits = name + sizeof(kPrefix) - 1;
+  const size_t length = strlen(digits);
+  if (length == 0 || length > 9 || digits[0] == '0' || strspn(digits, "0123456789") != length) {
+    return 0;
+  }
+  return strtoul(digits, nullptr, 10);
+}
+
 }  // namespace
+
+namespace kova {
+
+std::vector<std::string> ListVolumes() {
+  std::vector<std::pair<unsigned long, std::string>> found;
+  DIR* dir = opendir(SystemRoot().c_str());
+  if (dir == nullptr) return {};
+  while (const dirent* entry = readdir(dir)) {
+    const unsigned long number = VolumeNumber(entry->d_name);
+    if (number == 0) continue;
+    // The entry's type comes from the root's directory, while stat would ask
+    // the volume's own file system, which may hang; only a root file system
+    // that gives no types is asked.
+    struct stat info;
+    const bool directory = entry->d_type == DT_DIR ||
+                           (entry->d_type == DT_UNKNOWN &&
+                            fstatat(dirfd(dir), entry->d_name, &info, AT_SYMLINK_NOFOLLOW) == 0 &&
+                            S_ISDIR(info.st_mode));
+    if (directory) found.emplace_back(number, std::string("/") + entry->d_name);
+  }
+  closedir(dir);
+  std::sort(found.begin(), found.end());
+  std::vector<std::string> volumes;
+  for (auto& [number, path] : found) volumes.push_back(std::move(path));
+  return volumes;
+}
+
+}  // namespace kova
 
 int KOVAShareServiceVolumeGetbyLink(const char* link, char* volume, size_t size) {
   if (link == nullptr || volume == nullptr || size == 0 || !kova::IsPlainName(link)) {

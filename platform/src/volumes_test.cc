@@ -4,6 +4,7 @@
 #include "kova/error.h"
 #include "kova/service.h"
 #include "src/system_root.h"
+#include "src/volumes.h"
 #include "test_support/test_root.h"
 
 namespace {
@@ -34,6 +35,19 @@ TEST(VolumesTest, FollowsShareLinksIntoVolumes) {
     EXPECT_EQ(KOVAShareServiceVolumeGetbyLink(c.link, volume, c.size), c.result) << c.link;
     EXPECT_EQ(volume, c.volume) << c.link;
   }
+}
+
+TEST(VolumesTest, ListsTheVolumeDirectoriesInTheirNumbersOrder) {
+  kova_test::TestRoot root;
+  for (const char* dir : {"/volume10", "/volume2", "/volume1/share", "/volume", "/volume07",
+                          "/volumes", "/volume3x", "/usbshare1"}) {
+    kova::MakeDirectories(root.Path(dir), 0755);
+  }
+  root.Write("/volume4", "a file, not a volume");
+  ASSERT_EQ(symlink("/volume1", root.Path("/volume5").c_str()), 0);
+  EXPECT_EQ(kova::ListVolumes(), (std::vector<std::string>{"/volume1", "/volume2", "/volume10"}));
+  setenv("KOVA_ROOT", root.Path("/absent").c_str(), 1);
+  EXPECT_TRUE(kova::ListVolumes().empty());
 }
 
 }  // namespace

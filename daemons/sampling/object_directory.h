@@ -1,8 +1,8 @@
-// What the daemon learns about rules' objects outside /proc: the recorded
-// process of a started service, the volume of a LUN, display names.
+// What the daemons learn about the objects they measure outside /proc: the
+// recorded process of a started service, the volume of a LUN, display names.
 
-#ifndef KOVA_DAEMONS_PERFEVENTD_OBJECT_DIRECTORY_H_
-#define KOVA_DAEMONS_PERFEVENTD_OBJECT_DIRECTORY_H_
+#ifndef KOVA_DAEMONS_SAMPLING_OBJECT_DIRECTORY_H_
+#define KOVA_DAEMONS_SAMPLING_OBJECT_DIRECTORY_H_
 
 #include <sys/types.h>
 
@@ -14,7 +14,7 @@
 
 #include "src/lun_registry.h"
 
-namespace perfeventd {
+namespace sampling {
 
 // A process as a service's record names it: its id and start time in clock
 // ticks since boot, which tell it from a later process with the same id.
@@ -50,6 +50,9 @@ class SystemDirectory : public ObjectDirectory {
   std::string RealPath(const std::string& path) override;
   std::string DisplayName(int32_t type, const std::string& object) override;
 
+  // The LUNs of the registry as the last Refresh read it.
+  const std::vector<kova::Lun>& luns() const { return luns_; }
+
  private:
   // The LUN registry as last read, and the change time of its file then.
   std::vector<kova::Lun> luns_;
@@ -58,6 +61,6 @@ class SystemDirectory : public ObjectDirectory {
   ino_t luns_inode_ = 0;
 };
 
-}  // namespace perfeventd
+}  // namespace sampling
 
-#endif  // KOVA_DAEMONS_PERFEVENTD_OBJECT_DIRECTORY_H_
+#endif  // KOVA_DAEMONS_SAMPLING_OBJECT_DIRECTORY_H_

@@ -1,13 +1,13 @@
-#include "perfeventd/proc_reader.h"
+#include "sampling/proc_reader.h"
 
 #include <gtest/gtest.h>
 
 #include "kova/perfevent.h"
-#include "perfeventd/measurements.h"
+#include "sampling/measurements.h"
 #include "test_support/recorded_proc.h"
 #include "test_support/test_root.h"
 
-namespace perfeventd {
+namespace sampling {
 
 using kova_test::WriteFile;
 using kova_test::WriteProcess;
@@ -126,4 +126,4 @@ TEST(MeasurementsTest, MeasuresServicesSystemAndDisksBetweenTwoPasses) {
 }
 
 }  // namespace
-}  // namespace perfeventd
+}  // namespace sampling

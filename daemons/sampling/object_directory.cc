@@ -1,4 +1,4 @@
-#include "perfeventd/object_directory.h"
+#include "sampling/object_directory.h"
 
 #include <sys/stat.h>
 
@@ -6,11 +6,10 @@
 
 #include "kova/perfevent.h"
 #include "src/atomic_file.h"
-#include "src/conf_file.h"
 #include "src/services.h"
 #include "src/system_root.h"
 
-namespace perfeventd {
+namespace sampling {
 namespace {
 
 constexpr char kLunRegistry[] = "/etc/kova/iscsi/luns.json";
@@ -63,21 +62,7 @@ std::string SystemDirectory::DisplayName(int32_t type, const std::string& object
     }
     return object;
   }
-  if (type != PERFEVENT_TYPE_SERVICE) return object;
-  kova::ServiceDescription description;
-  if (kova::DescribeService(object, description) <= 0) return object;
-  // A package's service without a name of its own goes by the package's name.
-  if (!description.package.empty() && description.display_name == object) {
-    const std::string info = kova::RootPath("/var/packages/" + description.package + "/INFO");
-    std::string name;
-    for (const char* key : {"displayname_enu", "displayname"}) {
-      if (kova::IsPlainName(description.package) && kova::ConfRead(info, key, name) > 0 &&
-          !name.empty()) {
-        return name;
-      }
-    }
-  }
-  return description.display_name;
+  return type == PERFEVENT_TYPE_SERVICE ? kova::ServiceDisplayName(object) : object;
 }
 
-}  // namespace perfeventd
+}  // namespace sampling

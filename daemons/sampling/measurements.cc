@@ -1,10 +1,10 @@
-#include "perfeventd/measurements.h"
+#include "sampling/measurements.h"
 
 #include <algorithm>
 
 #include "kova/perfevent.h"
 
-namespace perfeventd {
+namespace sampling {
 namespace {
 
 constexpr char kNoCpu[] = "the CPU counters can't be read";
@@ -28,6 +28,7 @@ Measurements::Measurements(uint64_t page_kib) : page_kib_(page_kib) {}
 
 void Measurements::Advance(Snapshot now) {
   have_previous_ = true;
+  ++passes_;
   previous_ = std::move(current_);
   current_ = std::move(now);
   const std::vector<ProcessSample>& processes = current_.processes;
@@ -109,16 +110,20 @@ Measured Measurements::System(int32_t resource) const {
   }
 }
 
-Measured Measurements::Processes(pid_t pid, uint64_t start_time, int32_t resource) const {
-  if (!current_.processes_read) return Problem(kNoProcesses);
-  const int root = IndexOf(pid);
-  if (root < 0 || current_.processes[root].start_time != start_time) {
-    return Problem("its process is gone");
+int Measurements::Find(pid_t pid, uint64_t start_time, const char** problem) const {
+  if (!current_.processes_read) {
+    *problem = kNoProcesses;
+    return -1;
   }
-  const bool cpu = resource == PERFEVENT_RESOURCE_CPU;
-  if (cpu && !current_.cpu) return Problem(kNoCpu);
-  if (!cpu && current_.memory_total_kib == 0) return Problem(kNoMemory);
-  if (cpu && (!deltas_ || !previous_.cpu || previous_.cpu->total > current_.cpu->total)) return {};
+  const int index = IndexOf(pid);
+  if (index < 0 || current_.processes[index].start_time != start_time) {
+    *problem = "its process is gone";
+    return -1;
+  }
+  return index;
+}
+
+uint64_t Measurements::SumTree(int root, bool cpu) const {
   // The process and its descendants, depth first, each once: in a broken
   // recording parents may go round in a circle.
   if (++generation_ == 0) {  // wrapped round: the marks start afresh
@@ -137,6 +142,18 @@ Measured Measurements::Processes(pid_t pid, uint64_t start_time, int32_t resourc
       stack.push_back(child);
     }
   }
+  return sum;
+}
+
+Measured Measurements::Processes(pid_t pid, uint64_t start_time, int32_t resource) const {
+  const char* problem = nullptr;
+  const int root = Find(pid, start_time, &problem);
+  if (root < 0) return Problem(problem);
+  const bool cpu = resource == PERFEVENT_RESOURCE_CPU;
+  if (cpu && !current_.cpu) return Problem(kNoCpu);
+  if (!cpu && current_.memory_total_kib == 0) return Problem(kNoMemory);
+  if (cpu && (!deltas_ || !previous_.cpu || previous_.cpu->total > current_.cpu->total)) return {};
+  const uint64_t sum = SumTree(root, cpu);
   if (cpu) {
     return Of(100.0 * static_cast<double>(sum),
               static_cast<double>(current_.cpu->total - previous_.cpu->total));
@@ -144,6 +161,13 @@ Measured Measurements::Processes(pid_t pid, uint64_t start_time, int32_t resourc
   return Of(
       100.0 * static_cast<double>(sum * page_kib_) / static_cast<double>(current_.memory_total_kib),
       1);
+}
+
+Measured Measurements::Resident(pid_t pid, uint64_t start_time) const {
+  const char* problem = nullptr;
+  const int root = Find(pid, start_time, &problem);
+  if (root < 0) return Problem(problem);
+  return Of(static_cast<double>(SumTree(root, false) * page_kib_), 1);
 }
 
 Measured Measurements::Device(uint32_t major, uint32_t minor, int32_t resource) const {
@@ -177,4 +201,4 @@ Measured Measurements::Disks(const std::vector<const DiskSample*>& now,
   return Of(static_cast<double>(io_ms), static_cast<double>(ios));
 }
 
-}  // namespace perfeventd
+}  // namespace sampling

@@ -1,21 +1,22 @@
-// The resources of rules, measured from two consecutive passes over /proc.
+// The resources of the system, services and block devices, measured from two
+// consecutive passes over /proc.
 //
 // A measurement is a Reading: amount / base is the resource's value in its
 // unit (percent, KiB per second, milliseconds per I/O). Over several cycles
 // the sums of both give the value of the whole stretch, which is how a rule
 // whose period spans several cycles is measured.
 
-#ifndef KOVA_DAEMONS_PERFEVENTD_MEASUREMENTS_H_
-#define KOVA_DAEMONS_PERFEVENTD_MEASUREMENTS_H_
+#ifndef KOVA_DAEMONS_SAMPLING_MEASUREMENTS_H_
+#define KOVA_DAEMONS_SAMPLING_MEASUREMENTS_H_
 
 #include <cstdint>
 #include <optional>
 #include <string>
 #include <vector>
 
-#include "perfeventd/proc_reader.h"
+#include "sampling/proc_reader.h"
 
-namespace perfeventd {
+namespace sampling {
 
 struct Reading {
   double amount = 0;
@@ -45,11 +46,15 @@ class Measurements {
   // Moves on to the pass `now`; the pass before becomes the base of rates.
   void Advance(Snapshot now);
   const Snapshot& current() const { return current_; }
+  // The pass before the current one; nullptr until there were two.
+  const Snapshot* previous() const { return passes_ >= 2 ? &previous_ : nullptr; }
 
   // The whole system's `resource`; for I/O, summed over the physical disks.
   Measured System(int32_t resource) const;
   // The process `pid` that started at `start_time` and its descendants.
   Measured Processes(pid_t pid, uint64_t start_time, int32_t resource) const;
+  // Their resident memory in KiB (the reading's amount, over a base of 1).
+  Measured Resident(pid_t pid, uint64_t start_time) const;
   // The block device `major`:`minor`.
   Measured Device(uint32_t major, uint32_t minor, int32_t resource) const;
 
@@ -59,11 +64,18 @@ class Measurements {
  private:
   // The index of `pid` in the current pass, -1 when absent.
   int IndexOf(pid_t pid) const;
+  // The index of the process `pid` that started at `start_time`, or the
+  // problem that it can't be found.
+  int Find(pid_t pid, uint64_t start_time, const char** problem) const;
+  // The CPU ticks since the pass before (`cpu`) or the resident pages of the
+  // process at `root` and its descendants.
+  uint64_t SumTree(int root, bool cpu) const;
   Measured Disks(const std::vector<const DiskSample*>& now,
                  const std::vector<const DiskSample*>& before, int32_t resource) const;
 
   uint64_t page_kib_;
   bool have_previous_ = false;
+  uint64_t passes_ = 0;
   Snapshot previous_;
   Snapshot current_;
   bool deltas_ = false;                // whether `delta_ticks_` could be worked out
@@ -75,6 +87,6 @@ class Measurements {
   mutable uint32_t generation_ = 0;
 };
 
-}  // namespace perfeventd
+}  // namespace sampling
 
-#endif  // KOVA_DAEMONS_PERFEVENTD_MEASUREMENTS_H_
+#endif  // KOVA_DAEMONS_SAMPLING_MEASUREMENTS_H_

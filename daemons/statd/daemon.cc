@@ -1,0 +1,136 @@
+#include "statd/daemon.h"
+
+#include <errno.h>
+#include <signal.h>
+#include <syslog.h>
+
+#include <cmath>
+#include <ctime>
+#include <memory>
+#include <set>
+#include <string>
+
+#include "src/system_root.h"
+#include "statd/collector.h"
+#include "statd/pg_history.h"
+#include "statd/protocol.h"
+#include "statd/sampler.h"
+#include "statd/socket_server.h"
+
+namespace statd {
+namespace {
+
+constexpr char kSocketPath[] = "/run/kova/statd.sock";
+constexpr char kSpoolDir[] = "/var/lib/kova/statd/spool";
+
+void Log(int priority, const std::string& text) { syslog(priority, "%s", text.c_str()); }
+
+sigset_t HeldSignals() {
+  sigset_t signals;
+  sigemptyset(&signals);
+  for (int number : {SIGTERM, SIGINT, SIGHUP}) sigaddset(&signals, number);
+  return signals;
+}
+
+double Seconds(clockid_t clock) {
+  timespec now;
+  clock_gettime(clock, &now);
+  return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
+}
+
+// The collector's clock: Unix time, running 1/scale times as fast as the real
+// one from the start, so that tests can pass minutes in seconds.
+class ScaledClock {
+ public:
+  explicit ScaledClock(double scale)
+      : scale_(scale),
+        start_(Seconds(CLOCK_REALTIME)),
+        start_monotonic_(Seconds(CLOCK_MONOTONIC)) {}
+
+  double Now() const {
+    if (scale_ == 1) return Seconds(CLOCK_REALTIME);
+    return start_ + (Seconds(CLOCK_MONOTONIC) - start_monotonic_) / scale_;
+  }
+  // Real seconds until the clock shows `time`.
+  double RealUntil(double time) const { return (time - Now()) * scale_; }
+
+ private:
+  double scale_;
+  double start_;
+  double start_monotonic_;
+};
+
+std::string DefaultDatabase() {
+  return "host=" + kova::RootPath("/run/pgsql") + " user=kova dbname=kova_history";
+}
+
+}  // namespace
+
+void BlockSignals() {
+  const sigset_t signals = HeldSignals();
+  sigprocmask(SIG_BLOCK, &signals, nullptr);
+}
+
+int RunDaemon(const Options& options) {
+  openlog("kovastatd", LOG_PID | (options.log_to_stderr ? LOG_PERROR : 0), LOG_DAEMON);
+  signal(SIGPIPE, SIG_IGN);
+  const sigset_t signals = HeldSignals();
+  sigprocmask(SIG_BLOCK, &signals, nullptr);
+
+  const ScaledClock clock(options.time_scale);
+  PgHistoryTuning tuning;
+  tuning.now = [&clock] { return static_cast<int64_t>(clock.Now()); };
+  PgHistory history(options.database.empty() ? DefaultDatabase() : options.database,
+                    kova::RootPath(kSpoolDir), options.spool_max_bytes, Log, tuning);
+  Collector collector(history, options.interval);
+  std::string error;
+  if (!collector.Reload(error)) Log(LOG_WARNING, error + "; the defaults stand meanwhile");
+
+  kova::MakeDirectories(kova::RootPath("/run/kova"), 0755);
+  SocketServer server(kova::RootPath(kSocketPath),
+                      [&collector](std::string_view line) { return Answer(line, collector); });
+  if (!server.Start(error)) {
+    Log(LOG_ERR, error);
+    closelog();
+    return 1;
+  }
+  SamplerOptions sampler_options;
+  sampler_options.proc_dir = options.proc_dir;
+  sampler_options.sys_dir = options.sys_dir;
+  const std::unique_ptr<Sampler> sampler = MakeSystemSampler(sampler_options);
+  Log(LOG_INFO, "started: a sample every " + std::to_string(options.interval) + " s");
+
+  std::set<std::string> unreadable;
+  // Samples fall on whole multiples of the interval.
+  double next = std::floor(clock.Now() / options.interval + 1) * options.interval;
+  for (;;) {
+    const double wait = clock.RealUntil(next);
+    if (wait > 0) {
+      timespec timeout;
+      timeout.tv_sec = static_cast<time_t>(wait);
+      timeout.tv_nsec = static_cast<long>((wait - static_cast<double>(timeout.tv_sec)) * 1e9);
+      const int got = sigtimedwait(&signals, nullptr, &timeout);
+      if (got == SIGTERM || got == SIGINT) break;
+      if (got == SIGHUP && !collector.Reload(error)) Log(LOG_WARNING, error);
+      if (got >= 0 || errno == EINTR) continue;
+    }
+    std::vector<SeriesValue> values = sampler->Cycle();
+    // What can't be read is said once, and again only after it was read.
+    const std::set<std::string> now(sampler->Unreadable().begin(), sampler->Unreadable().end());
+    for (const std::string& what : now) {
+      if (!unreadable.count(what)) Log(LOG_WARNING, "can't read " + what);
+    }
+    unreadable = now;
+    collector.Record(static_cast<int64_t>(next), values);
+    // A late sample doesn't make up for the missed ones.
+    next += options.interval;
+    if (next < clock.Now())
+      next = std::floor(clock.Now() / options.interval + 1) * options.interval;
+  }
+  server.Stop();
+  Log(LOG_INFO, "stopped");
+  closelog();
+  return 0;
+}
+
+}  // namespace statd

@@ -1,8 +1,14 @@
+#include <grp.h>
 #include <gtest/gtest.h>
+#include <pwd.h>
 #include <signal.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
+#include <fstream>
+#include <iterator>
+#include <sstream>
 #include <string>
 #include <thread>
 
@@ -97,13 +103,25 @@ TEST_F(ServicesTest, ServicesThatCannotStartSayWhy) {
   root_.Write("/etc/kova/services/missing.conf", "command=\"/nonexistent/daemon\"\n");
   root_.Write("/etc/kova/services/nocommand.conf", "display_name=\"Nothing to run\"\n");
   root_.Write("/etc/kova/services/open.conf", "command=/bin/sh \"-c\n");
+  root_.Write("/etc/kova/services/ghost.conf",
+              "command=\"/bin/sleep 300\"\nuser=\"kova-no-such-account\"\n");
+  root_.Write("/etc/kova/services/kill.conf", "command=\"/bin/sleep 300\"\nstop_signal=KILL\n");
+  root_.Write("/etc/kova/services/zero.conf", "command=\"/bin/sleep 300\"\nstop_timeout=0\n");
+  root_.Write("/etc/kova/services/unit.conf", "command=\"/bin/sleep 300\"\nstop_timeout=5s\n");
   const struct {
     const char* name;
     int error;
   } cases[] = {
-      {"unknown", KOVA_ERR_SERVICE_UNKNOWN}, {"../demo", KOVA_ERR_INVALID},
-      {"relative", KOVA_ERR_FORMAT},         {"open", KOVA_ERR_FORMAT},
-      {"missing", KOVA_ERR_SERVICE_FAILED},  {"nocommand", KOVA_ERR_SERVICE_UNKNOWN},
+      {"unknown", KOVA_ERR_SERVICE_UNKNOWN},
+      {"../demo", KOVA_ERR_INVALID},
+      {"relative", KOVA_ERR_FORMAT},
+      {"open", KOVA_ERR_FORMAT},
+      {"missing", KOVA_ERR_SERVICE_FAILED},
+      {"nocommand", KOVA_ERR_SERVICE_UNKNOWN},
+      {"ghost", KOVA_ERR_NOT_FOUND},
+      {"kill", KOVA_ERR_FORMAT},
+      {"zero", KOVA_ERR_FORMAT},
+      {"unit", KOVA_ERR_FORMAT},
   };
   for (const auto& c : cases) {
     EXPECT_LT(QLIBServiceStart(c.name, 0), 0) << c.name;
@@ -111,6 +129,108 @@ TEST_F(ServicesTest, ServicesThatCannotStartSayWhy) {
     EXPECT_EQ(QLIBServiceIsRunning(c.name), 0) << c.name;
   }
   EXPECT_LT(QLIBServiceStart(nullptr, 0), 0);
+}
+
+// The ids of a process as /proc/<pid>/status gives them: "Uid:", "Gid:" and
+// "Groups:" lines, with the groups sorted.
+std::string StatusIds(pid_t pid) {
+  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+  std::string out;
+  for (std::string line; std::getline(status, line);) {
+    std::istringstream words(line);
+    std::string key;
+    words >> key;
+    if (key != "Uid:" && key != "Gid:" && key != "Groups:") continue;
+    std::vector<long> ids{std::istream_iterator<long>(words), {}};
+    if (key == "Groups:") std::sort(ids.begin(), ids.end());
+    out += key;
+    for (long id : ids) out += " " + std::to_string(id);
+    out += "\n";
+  }
+  return out;
+}
+
+// The lines of `text`, sorted.
+std::string SortedLines(const std::string& text) {
+  std::vector<std::string> lines;
+  std::istringstream in(text);
+  for (std::string line; std::getline(in, line);) lines.push_back(line + "\n");
+  std::sort(lines.begin(), lines.end());
+  std::string out;
+  for (const std::string& line : lines) out += line;
+  return out;
+}
+
+// The same lines for account `name` holding every id, from the user database.
+std::string AccountIds(const char* name) {
+  const passwd* entry = getpwnam(name);
+  if (entry == nullptr) return "(no account " + std::string(name) + ")";
+  const std::string uid = std::to_string(entry->pw_uid);
+  const std::string gid = std::to_string(entry->pw_gid);
+  gid_t groups[256];
+  int count = 256;
+  getgrouplist(name, entry->pw_gid, groups, &count);
+  std::sort(groups, groups + count);
+  std::string out = "Uid: " + uid + " " + uid + " " + uid + " " + uid + "\nGid: " + gid + " " +
+                    gid + " " + gid + " " + gid + "\nGroups:";
+  for (int i = 0; i < count; ++i) out += " " + std::to_string(groups[i]);
+  return out + "\n";
+}
+
+// Started by root, a service runs as its account; started by anyone else, with
+// the caller's ids.
+TEST_F(ServicesTest, RunsWithTheIdsOfItsAccount) {
+  // postgres has a supplementary group on Debian; nobody is there everywhere.
+  const char* account = getpwnam("postgres") != nullptr ? "postgres" : "nobody";
+  root_.Write("/etc/kova/services/demo.conf",
+              "command=\"/bin/sleep 300\"\nuser=\"" + std::string(account) + "\"\n");
+  ASSERT_EQ(QLIBServiceStart("demo", 0), 0);
+  const std::string expected = geteuid() == 0 ? AccountIds(account) : StatusIds(getpid());
+  EXPECT_EQ(StatusIds(Recorded().pid), expected);
+  EXPECT_NE(expected.find("Groups:"), std::string::npos);
+  ASSERT_EQ(QLIBServiceStop("demo", 0), 0);
+}
+
+// The stop signal goes to the main process alone; its group gets SIGKILL once
+// the main process has ended, or once the grace is over. (USR1 and not INT: a
+// shell's background job can't catch SIGINT.)
+TEST_F(ServicesTest, StopSignalReachesTheMainProcessOnly) {
+  root_.Write("/opt/family.sh", R"sh(log="$KOVA_ROOT/signals"
+(trap 'echo child USR1 >> "$log"' USR1; trap 'echo child TERM >> "$log"; exit 0' TERM
+ : > "$KOVA_ROOT/child_ready"; while :; do sleep 0.05; done) &
+echo $! > "$KOVA_ROOT/child"
+trap 'echo main USR1 >> "$log"; [ "$1" = stay ] || exit 0' USR1
+trap 'echo main TERM >> "$log"; exit 0' TERM
+while :; do sleep 0.05; done
+)sh");
+  const struct {
+    const char* keys;
+    const char* main;  // "exit" or "stay" on the stop signal
+    const char* signals;
+    milliseconds least;
+  } cases[] = {
+      {"", "exit", "child TERM\nmain TERM\n", milliseconds(0)},
+      {"stop_signal=\"USR1\"\n", "exit", "main USR1\n", milliseconds(0)},
+      {"stop_signal=SIGUSR1\nstop_timeout=1\n", "stay", "main USR1\n", milliseconds(1000)},
+  };
+  for (const auto& c : cases) {
+    for (const char* file : {"/signals", "/child", "/child_ready"})
+      unlink(root_.Path(file).c_str());
+    root_.Write(
+        "/etc/kova/services/demo.conf",
+        "command=\"/bin/sh " + root_.Path("/opt/family.sh") + " " + c.main + "\"\n" + c.keys);
+    ASSERT_EQ(QLIBServiceStart("demo", 0), 0) << c.keys;
+    const kova::ProcessIdentity main = Recorded();
+    ASSERT_TRUE(Eventually([&] { return access(root_.Path("/child_ready").c_str(), F_OK) == 0; }));
+    kova::ProcessIdentity child{std::stoi(root_.Read("/child")), 0};
+    ASSERT_TRUE(kova::ReadProcessStart(child.pid, child.start_time));
+    const auto start = std::chrono::steady_clock::now();
+    ASSERT_EQ(QLIBServiceStop("demo", 0), 0) << c.keys;
+    EXPECT_GE(std::chrono::steady_clock::now() - start, c.least) << c.keys;
+    EXPECT_FALSE(kova::IsAlive(main)) << c.keys;
+    EXPECT_TRUE(Eventually([&] { return !kova::IsAlive(child); })) << c.keys;
+    EXPECT_EQ(SortedLines(root_.Read("/signals")), c.signals) << c.keys;
+  }
 }
 
 TEST_F(ServicesTest, DisplayNames) {
@@ -144,7 +264,7 @@ TEST(ServiceProcessTest, TerminateKillsWhatIgnoresTerm) {
   kova::ProcessIdentity process;
   ASSERT_TRUE(kova::LaunchDetached(
       {"/bin/sh", "-c", "trap '' TERM; : > \"$0\"; while :; do sleep 0.05; done", ready},
-      {"PATH=/usr/bin:/bin"}, process));
+      {"PATH=/usr/bin:/bin"}, nullptr, process));
   ASSERT_TRUE(Eventually([&] { return access(ready.c_str(), F_OK) == 0; }));  // TERM ignored now
   const auto start = std::chrono::steady_clock::now();
   EXPECT_TRUE(kova::Terminate(process, milliseconds(300)));

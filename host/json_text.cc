@@ -13,6 +13,8 @@ std::string ToJson(const Json::Value& value) {
     Json::StreamWriterBuilder builder;
     builder["indentation"] = "";
     builder["emitUTF8"] = true;
+    // 15 significant digits give 12.3 back as 12.3; 17 would show binary noise.
+    builder["precision"] = 15;
     return std::unique_ptr<Json::StreamWriter>(builder.newStreamWriter());
   }();
   std::ostringstream out;

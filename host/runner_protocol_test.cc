@@ -30,11 +30,12 @@ class RunnerProtocolTest : public ::testing::Test {
 TEST_F(RunnerProtocolTest, CallsAndAnswersCrossWhole) {
   Json::Value params;
   params["filter"]["loglevel"] = "Warning";
+  params["values"].append(12.3);
   const RunnerCall sent{"KOVA.ResourceMonitor.Log", 1, "list", params, "admin", "ger"};
   ASSERT_EQ(SendCall(fds_[0], sent, kNoDeadline), IoResult::kOk);
   RunnerCall got;
   ASSERT_EQ(ReceiveCall(reader_[1], got), IoResult::kOk);
-  EXPECT_EQ(ToJson(got.params), ToJson(params));
+  EXPECT_EQ(ToJson(got.params), R"({"filter":{"loglevel":"Warning"},"values":[12.3]})");
   EXPECT_EQ(got.api + got.method + got.user + got.language, "KOVA.ResourceMonitor.Loglistadminger");
 
   // A raw answer larger than a socket buffer, with bytes that are no UTF-8.

@@ -17,93 +17,25 @@
 #include <thread>
 #include <vector>
 
+#include "test_support/daemon_service.h"
 #include "test_support/host_call.h"
-#include "test_support/perfevent_daemon.h"
 #include "test_support/test_root.h"
+#include "test_support/webapid.h"
 
 namespace {
 
+using kova_test::Code;
+using kova_test::Form;
 using kova_test::ParseJson;
+using kova_test::Reply;
 using ::testing::HasSubstr;
 using ::testing::Not;
 
-constexpr char kEntry[] = "/webapi/entry.cgi";
 constexpr char kAdminPassword[] = "admin pw: 5ecret!";
 constexpr char kGuestPassword[] = "guest-pw";
 
 // The performance-event daemon as a script that only waits.
 constexpr char kDaemon[] = "trap 'exit 0' TERM\nwhile :; do sleep 0.05; done\n";
-
-std::string Escape(const std::string& text) { return httplib::detail::encode_query_param(text); }
-
-// A form-encoded body or query: Form({{"api", "X"}, {"version", "1"}}).
-std::string Form(const std::vector<std::pair<std::string, std::string>>& fields) {
-  std::string out;
-  for (const auto& [name, value] : fields) {
-    out += (out.empty() ? "" : "&") + Escape(name) + "=" + Escape(value);
-  }
-  return out;
-}
-
-// A kova-webapid over the test's root; stopped with SIGTERM at the end.
-class Host {
- public:
-  Host(const kova_test::TestRoot& root, const std::vector<std::string>& args)
-      : log_(root.Path("/host.log")) {
-    std::vector<std::string> argv = {KOVA_WEBAPID_PATH,     "--port",   "0",         "--modules",
-                                     root.Path("/modules"), "--static", KOVA_WWW_DIR};
-    argv.insert(argv.end(), args.begin(), args.end());
-    pid_ = fork();
-    if (pid_ == 0) {
-      freopen(log_.c_str(), "w", stderr);
-      std::vector<char*> raw;
-      for (std::string& arg : argv) raw.push_back(arg.data());
-      raw.push_back(nullptr);
-      execv(raw[0], raw.data());
-      _exit(127);
-    }
-    const std::regex listening("listening on http://127.0.0.1:([0-9]+)/");
-    for (int i = 0; i < 200 && port_ == 0; ++i) {
-      std::smatch match;
-      const std::string log = Log();
-      if (std::regex_search(log, match, listening)) port_ = std::stoi(match[1]);
-      if (port_ == 0) std::this_thread::sleep_for(std::chrono::milliseconds(50));
-    }
-    EXPECT_NE(port_, 0) << Log();
-  }
-  ~Host() {
-    kill(pid_, SIGTERM);
-    int status = 0;
-    for (int i = 0; i < 100 && waitpid(pid_, &status, WNOHANG) == 0; ++i) {
-      std::this_thread::sleep_for(std::chrono::milliseconds(50));
-    }
-    if (waitpid(pid_, &status, WNOHANG) == 0) {
-      ADD_FAILURE() << "kova-webapid did not stop on SIGTERM:\n" << Log();
-      kill(pid_, SIGKILL);
-      waitpid(pid_, &status, 0);
-    }
-  }
-  Host(const Host&) = delete;
-  Host& operator=(const Host&) = delete;
-
-  int port() const { return port_; }
-  std::string Log() const {
-    std::ifstream in(log_);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-  }
-
- private:
-  std::string log_;
-  pid_t pid_ = -1;
-  int port_ = 0;
-};
-
-struct Reply {
-  int status = 0;
-  Json::Value json;  // null when the body is no JSON
-  std::string body;
-  httplib::Headers headers;
-};
 
 class WebApidTest : public ::testing::Test {
  protected:
@@ -139,57 +71,31 @@ class WebApidTest : public ::testing::Test {
   }
 
   void Kova(const std::string& args, const std::string& input = "") {
-    FILE* command = popen((std::string(KOVA_TOOL_PATH) + " " + args + " >/dev/null").c_str(), "w");
-    ASSERT_NE(command, nullptr);
-    fputs((input + "\n").c_str(), command);
-    pclose(command);
+    ASSERT_NE(kova_test::RunKova(KOVA_TOOL_PATH, args, input), -1);
   }
 
   void Start(const std::vector<std::string>& args = {}) {
-    host_ = std::make_unique<Host>(root_, args);
+    std::vector<std::string> all = {"--modules", root_.Path("/modules"), "--static", KOVA_WWW_DIR};
+    all.insert(all.end(), args.begin(), args.end());
+    host_ = std::make_unique<kova_test::WebApid>(KOVA_WEBAPID_PATH, root_.path(), all);
   }
 
   Reply Send(const std::string& method, const std::string& form, const httplib::Headers& headers) {
-    httplib::Client client("127.0.0.1", host_->port());
-    client.set_read_timeout(std::chrono::seconds(30));
-    httplib::Result result =
-        method == "GET" ? client.Get(std::string(kEntry) + "?" + form, headers)
-                        : client.Post(kEntry, headers, form, "application/x-www-form-urlencoded");
-    Reply reply;
-    if (!result) {
-      ADD_FAILURE() << "no answer to " << form;
-      return reply;
-    }
-    reply.status = result->status;
-    reply.body = result->body;
-    reply.headers = result->headers;
-    try {
-      reply.json = ParseJson(result->body);
-    } catch (const std::exception&) {
-    }
-    return reply;
+    return host_->Send(method, form, headers);
   }
-
-  // Calls api/method, version 1, with `params` and the session of `sid` as a parameter.
-  Reply Call(const std::string& api, const std::string& method,
-             std::vector<std::pair<std::string, std::string>> params = {},
+  Reply Call(const std::string& api, const std::string& method, kova_test::Params params = {},
              const std::string& sid = "", const httplib::Headers& headers = {}) {
-    params.insert(params.begin(), {{"api", api}, {"version", "1"}, {"method", method}});
-    if (!sid.empty()) params.emplace_back("_sid", sid);
-    return Send("POST", Form(params), headers);
+    return host_->Call(api, method, std::move(params), sid, headers);
   }
-
   Reply SignIn(const std::string& account, const std::string& password) {
-    return Call("KOVA.API.Auth", "login", {{"account", account}, {"password", password}});
+    return host_->SignIn(account, password);
   }
   std::string Sid(const std::string& account, const std::string& password) {
-    return SignIn(account, password).json["data"]["sid"].asString();
+    return host_->Sid(account, password);
   }
 
-  static int Code(const Reply& reply) { return reply.json["error"]["code"].asInt(); }
-
   kova_test::TestRoot root_;
-  std::unique_ptr<Host> host_;
+  std::unique_ptr<kova_test::WebApid> host_;
 };
 
 constexpr char kSetting[] = "KOVA.ResourceMonitor.Setting";
@@ -269,7 +175,7 @@ TEST_F(WebApidTest, ServesEveryMethodOfTheModule) {
 TEST_F(WebApidTest, ARuleMadeOverHttpRaisesAWarningFromTheRealDaemon) {
   // The real daemon as the service, on the live /proc, a cycle every 250 ms:
   // its 30 s window takes 1.5 s, with enough clock ticks for a CPU share to show.
-  ASSERT_TRUE(kova_test::InstallDaemonService(KOVA_INSTALL_SERVICE, root_.path(),
+  ASSERT_TRUE(kova_test::InstallDaemonService(KOVA_INSTALL_SERVICE, root_.path(), "kovaperfeventd",
                                               KOVAPERFEVENTD_PATH, "--time-scale 0.05",
                                               root_.Path("/daemon.err")));
   root_.Write("/etc/kova/services/burner.conf",
@@ -499,7 +405,7 @@ TEST_F(WebApidTest, RefusesBadInputWithAClearError) {
     EXPECT_TRUE(reply.json["error"]["errors"]["reason"].isString()) << c.what;
   }
   httplib::Client client("127.0.0.1", host_->port());
-  EXPECT_EQ(client.Post(kEntry, "{}", "application/json")->status, 415);
+  EXPECT_EQ(client.Post(kova_test::kEntryPath, "{}", "application/json")->status, 415);
   EXPECT_TRUE(Call(kSetting, "get", {}, sid).json["success"].asBool());  // still serving
 }
 

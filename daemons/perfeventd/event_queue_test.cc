@@ -6,7 +6,7 @@
 #include <unistd.h>
 
 #include "kova/log.h"
-#include "test_support/perfevent_daemon.h"
+#include "test_support/perfevent_log.h"
 #include "test_support/test_root.h"
 
 namespace perfeventd {

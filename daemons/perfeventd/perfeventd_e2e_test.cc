@@ -17,9 +17,9 @@
 #include "kova/perfevent.h"
 #include "kova/service.h"
 #include "kova/webapi.h"
+#include "test_support/daemon_service.h"
 #include "test_support/host_call.h"
 #include "test_support/module_host.h"
-#include "test_support/perfevent_daemon.h"
 #include "test_support/recorded_proc.h"
 #include "test_support/test_root.h"
 
@@ -47,8 +47,8 @@ class PerfEventE2eTest : public ::testing::Test {
   // Installs the service: the daemon with `options`, its system-log lines
   // into /daemon.err.
   void InstallDaemon(const std::string& options) {
-    ASSERT_TRUE(InstallDaemonService(KOVA_INSTALL_SERVICE, root_.path(), KOVAPERFEVENTD_PATH,
-                                     options, root_.Path("/daemon.err")));
+    ASSERT_TRUE(InstallDaemonService(KOVA_INSTALL_SERVICE, root_.path(), "kovaperfeventd",
+                                     KOVAPERFEVENTD_PATH, options, root_.Path("/daemon.err")));
   }
 
   // The daemon's system-log lines, without the "kovaperfeventd[pid]: ".

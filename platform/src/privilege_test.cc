@@ -3,8 +3,6 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <algorithm>
-#include <cerrno>
 #include <stdexcept>
 
 #include "test_support/run_in_child.h"
@@ -60,33 +58,6 @@ TEST(PrivilegeTest, BecomesRootForGoodFromTheHostsIds) {
     ASSERT_EQ(getresgid(&gid[0], &gid[1], &gid[2]), 0);
     EXPECT_EQ(uid[0] | uid[1] | uid[2] | gid[0] | gid[1] | gid[2], 0u);
     EXPECT_EQ(getgroups(0, nullptr), 0);
-  }));
-}
-
-// From the ids of a host's runner that raised root (real ids not 0), a
-// service's child takes its account's ids for good.
-TEST(PrivilegeTest, BecomesTheAccountForGood) {
-  kova::Account account;
-  EXPECT_FALSE(kova::LookUpAccount("kova-no-such-account", account));
-  EXPECT_EQ(errno, 0);
-  ASSERT_TRUE(kova::LookUpAccount("nobody", account));
-  ASSERT_NE(account.uid, 0u);
-  EXPECT_NE(std::find(account.groups.begin(), account.groups.end(), account.gid),
-            account.groups.end());
-  EXPECT_TRUE(kova_test::RunInChild([&account] {
-    ASSERT_EQ(setresgid(1000, 0, 0), 0);
-    ASSERT_EQ(setresuid(1000, 0, 0), 0);
-    ASSERT_TRUE(kova::BecomeAccountForGood(account));
-    uid_t uid[3];
-    gid_t gid[3];
-    ASSERT_EQ(getresuid(&uid[0], &uid[1], &uid[2]), 0);
-    ASSERT_EQ(getresgid(&gid[0], &gid[1], &gid[2]), 0);
-    for (int i = 0; i < 3; ++i) {
-      EXPECT_EQ(uid[i], account.uid) << i;
-      EXPECT_EQ(gid[i], account.gid) << i;
-    }
-    EXPECT_EQ(getgroups(0, nullptr), static_cast<int>(account.groups.size()));
-    EXPECT_NE(setuid(0), 0);
   }));
 }
 

@@ -1,4 +1,5 @@
-// Raising the effective ids to root around work that changes system state.
+// Raising the effective ids to root around work that changes system state, and
+// the ids a service's process takes for good between fork and exec.
 //
 // The host runs modules with unprivileged effective ids and saved ids 0. A
 // platform call that writes system files or controls services raises the
@@ -9,6 +10,9 @@
 #define KOVA_PLATFORM_SRC_PRIVILEGE_H_
 
 #include <sys/types.h>
+
+#include <string>
+#include <vector>
 
 namespace kova {
 
@@ -39,6 +43,27 @@ class RootScope {
 // true when the process is not root (its ids are then kept). Returns false with
 // errno set when a call fails. Async-signal-safe: for use between fork and exec.
 bool BecomeRootForGood();
+
+// The ids of an account a service runs as, looked up before fork so that the
+// child only has to make system calls.
+struct Account {
+  uid_t uid = 0;
+  gid_t gid = 0;              // the primary group
+  std::vector<gid_t> groups;  // every group of the account, the primary one too
+};
+
+// Looks up account `name` and its groups in the user and group databases.
+// Returns true with the ids in `account`; false when there is no such account
+// (errno 0) or the databases can't be read (errno set).
+bool LookUpAccount(const std::string& name, Account& account);
+
+// Gives up root for good for `account`: sets the groups, then the real,
+// effective and saved group ids, then the user ids, checks every call, verifies
+// the ids and that root can't be regained. Does nothing and returns true when
+// the process is not root (its ids are then kept). Returns false with errno set
+// (EPERM when a check doesn't hold) on failure, and the process must not go on
+// to run the service. Async-signal-safe: for use between fork and exec.
+bool BecomeAccountForGood(const Account& account);
 
 }  // namespace kova
 

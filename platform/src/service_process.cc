@@ -28,11 +28,12 @@ void Tell(int fd, char tag, int value) {
   [[maybe_unused]] ssize_t ignored = write(fd, &message, sizeof(message));
 }
 
-[[noreturn]] void RunService(int report, char* const* argv, char* const* env) {
+[[noreturn]] void RunService(int report, char* const* argv, char* const* env,
+                             const Account* account) {
   setsid();
   const int null = open("/dev/null", O_RDWR);
   if (null < 0 || dup2(null, 0) < 0 || dup2(null, 1) < 0 || dup2(null, 2) < 0 ||
-      !BecomeRootForGood()) {
+      !(account != nullptr ? BecomeAccountForGood(*account) : BecomeRootForGood())) {
     Tell(report, 'E', errno);
     _exit(127);
   }
@@ -47,6 +48,21 @@ void Tell(int fd, char tag, int value) {
   execve(argv[0], argv, env);
   Tell(report, 'E', errno);
   _exit(127);
+}
+
+// Waits up to `limit` for `process` to end; true when it has.
+bool AwaitEnd(const ProcessIdentity& process, std::chrono::milliseconds limit) {
+  const auto deadline = std::chrono::steady_clock::now() + limit;
+  while (IsAlive(process) && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  }
+  return !IsAlive(process);
+}
+
+// Sends `number` to the process group that `pid` leads, or to the process alone
+// when it leads none. False with errno set when neither could be signalled.
+bool SignalGroup(pid_t pid, int number) {
+  return kill(-pid, number) == 0 || kill(pid, number) == 0;
 }
 
 std::vector<char*> Pointers(const std::vector<std::string>& texts) {
@@ -81,7 +97,7 @@ bool IsAlive(const ProcessIdentity& process) {
 }
 
 bool LaunchDetached(const std::vector<std::string>& argv, const std::vector<std::string>& env,
-                    ProcessIdentity& started) {
+                    const Account* account, ProcessIdentity& started) {
   if (argv.empty() || argv[0].empty() || argv[0][0] != '/') {
     errno = EINVAL;
     return false;
@@ -103,7 +119,7 @@ bool LaunchDetached(const std::vector<std::string>& argv, const std::vector<std:
     // child of this process and init reaps it.
     close(pipe_fds[0]);
     const pid_t service = fork();
-    if (service == 0) RunService(pipe_fds[1], args.data(), environment.data());
+    if (service == 0) RunService(pipe_fds[1], args.data(), environment.data(), account);
     Tell(pipe_fds[1], service < 0 ? 'E' : 'P', service < 0 ? errno : service);
     _exit(0);
   }
@@ -135,25 +151,20 @@ bool LaunchDetached(const std::vector<std::string>& argv, const std::vector<std:
   return true;
 }
 
-bool Terminate(const ProcessIdentity& process, std::chrono::milliseconds grace) {
-  using std::chrono::steady_clock;
-  for (int signal_number : {SIGTERM, SIGKILL}) {
-    if (!IsAlive(process)) return true;
-    // The service leads its own process group; its children go with it.
-    if (kill(-process.pid, signal_number) != 0 && kill(process.pid, signal_number) != 0) {
-      return errno == ESRCH;
-    }
-    const auto deadline =
-        steady_clock::now() + (signal_number == SIGTERM ? grace : std::chrono::milliseconds(2000));
-    while (IsAlive(process) && steady_clock::now() < deadline) {
-      std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    }
+bool Terminate(const ProcessIdentity& process, std::chrono::milliseconds grace, int stop_signal) {
+  if (!IsAlive(process)) return true;
+  const bool sent =
+      stop_signal == 0 ? SignalGroup(process.pid, SIGTERM) : kill(process.pid, stop_signal) == 0;
+  if (!sent) return errno == ESRCH;
+  if (AwaitEnd(process, grace)) {
+    // The service leads its group; its pid names the group while members are left.
+    if (stop_signal != 0) kill(-process.pid, SIGKILL);
+    return true;
   }
-  if (IsAlive(process)) {
-    errno = ETIMEDOUT;
-    return false;
-  }
-  return true;
+  if (!SignalGroup(process.pid, SIGKILL)) return errno == ESRCH;
+  if (AwaitEnd(process, std::chrono::milliseconds(2000))) return true;
+  errno = ETIMEDOUT;
+  return false;
 }
 
 bool SplitCommand(const std::string& line, std::vector<std::string>& words) {

@@ -6,10 +6,13 @@
 #include <errno.h>
 #include <signal.h>
 #include <sys/stat.h>
+#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <cctype>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <string_view>
 
@@ -28,7 +31,23 @@ constexpr char kServicesDir[] = "/etc/kova/services/";
 constexpr char kRunDir[] = "/run/kova";
 constexpr char kPackagesDir[] = "/var/packages/";
 constexpr char kPackagePrefix[] = "pkgctl-";
-constexpr auto kStopGrace = std::chrono::milliseconds(5000);
+constexpr int kDefaultStopTimeout = 5;  // seconds
+constexpr int kMaxStopTimeout = 3600;
+
+// The signals a description may name to stop its service.
+constexpr struct {
+  const char* name;
+  int number;
+} kStopSignals[] = {
+    {"HUP", SIGHUP},   {"INT", SIGINT},   {"QUIT", SIGQUIT}, {"TERM", SIGTERM},
+    {"USR1", SIGUSR1}, {"USR2", SIGUSR2}, {nullptr, 0},
+};
+
+// How a service is stopped: `signal` 0 is SIGTERM to its process group.
+struct StopPolicy {
+  int signal = 0;
+  std::chrono::milliseconds grace{kDefaultStopTimeout * 1000};
+};
 
 std::string DescriptionPath(const std::string& name) {
   return RootPath(kServicesDir + name + ".conf");
@@ -57,6 +76,33 @@ bool IsRunning(const std::string& name) {
   return ReadPidFile(name, process) && IsAlive(process);
 }
 
+// Reads the stop keys of `description` into `policy`. False, and `policy` left
+// as it was, when a key holds something else than a known signal or a number of
+// seconds in range.
+bool ReadStopPolicy(const ServiceDescription& description, StopPolicy& policy) {
+  StopPolicy read;
+  if (!description.stop_signal.empty()) {
+    std::string_view name = description.stop_signal;
+    if (name.rfind("SIG", 0) == 0) name.remove_prefix(3);
+    int row = 0;
+    while (kStopSignals[row].name != nullptr && name != kStopSignals[row].name) ++row;
+    if (kStopSignals[row].name == nullptr) return false;
+    read.signal = kStopSignals[row].number;
+  }
+  if (!description.stop_timeout.empty()) {
+    const std::string& text = description.stop_timeout;
+    char* end = nullptr;
+    const long seconds = strtol(text.c_str(), &end, 10);
+    if (!isdigit(static_cast<unsigned char>(text[0])) || *end != '\0' || seconds < 1 ||
+        seconds > kMaxStopTimeout) {
+      return false;
+    }
+    read.grace = std::chrono::seconds(seconds);
+  }
+  policy = read;
+  return true;
+}
+
 // Records `error` where it happened and fails with -1.
 #define FAILED(error) (KOVA_SET_ERROR(error), -1)
 
@@ -81,15 +127,26 @@ int Start(const std::string& name) {
       argv[0][0] != '/') {
     return FAILED(description.command.empty() ? KOVA_ERR_SERVICE_UNKNOWN : KOVA_ERR_FORMAT);
   }
+  StopPolicy stop;
+  if (!ReadStopPolicy(description, stop)) return FAILED(KOVA_ERR_FORMAT);
+  Account account;
+  if (!description.user.empty() && !LookUpAccount(description.user, account)) {
+    const bool unknown = errno == 0 || errno == ENOENT;
+    syslog(LOG_DAEMON | LOG_ERR, "kova: service %s: %s account \"%s\"", name.c_str(),
+           unknown ? "no such" : "cannot look up the", description.user.c_str());
+    return FAILED(unknown ? KOVA_ERR_NOT_FOUND : KOVA_ERR_IO);
+  }
   const std::vector<std::string> env = {
       "PATH=/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin", "LANG=C.UTF-8",
       "KOVA_ROOT=" + SystemRoot()};
   ProcessIdentity process;
-  if (!LaunchDetached(argv, env, process)) return FAILED(KOVA_ERR_SERVICE_FAILED);
+  if (!LaunchDetached(argv, env, description.user.empty() ? nullptr : &account, process)) {
+    return FAILED(KOVA_ERR_SERVICE_FAILED);
+  }
   const std::string record =
       std::to_string(process.pid) + " " + std::to_string(process.start_time) + "\n";
   if (!ReplaceFile(PidPath(name), record, 0644)) {
-    Terminate(process, kStopGrace);
+    Terminate(process, stop.grace, stop.signal);
     return FAILED(KOVA_ERR_IO);
   }
   return 0;
@@ -103,7 +160,13 @@ int Stop(const std::string& name) {
   const bool recorded = ReadPidFile(name, process);
   ServiceDescription description;
   if (!recorded && DescribeService(name, description) <= 0) return -1;
-  if (recorded && !Terminate(process, kStopGrace)) {
+  // A service whose description is gone or broken since its start stops the usual way.
+  StopPolicy stop;
+  if (recorded && access(DescriptionPath(name).c_str(), F_OK) == 0 &&
+      DescribeService(name, description) > 0) {
+    ReadStopPolicy(description, stop);
+  }
+  if (recorded && !Terminate(process, stop.grace, stop.signal)) {
     return FAILED(errno == EPERM ? KOVA_ERR_PERMISSION : KOVA_ERR_SERVICE_FAILED);
   }
   if (unlink(PidPath(name).c_str()) != 0 && errno != ENOENT) return FAILED(KOVA_ERR_IO);
@@ -129,7 +192,7 @@ int DescribeService(const std::string& name, ServiceDescription& description) {
     KOVA_SET_ERROR(KOVA_ERR_INVALID);
     return 0;
   }
-  description = ServiceDescription{name, "", name, ""};
+  description = ServiceDescription{name, "", name, "", "", "", ""};
   const std::string path = DescriptionPath(name);
   if (access(path.c_str(), F_OK) != 0) {
     const std::string package = name.substr(std::min(name.size(), sizeof(kPackagePrefix) - 1));
@@ -141,9 +204,12 @@ int DescribeService(const std::string& name, ServiceDescription& description) {
     KOVA_SET_ERROR(KOVA_ERR_SERVICE_UNKNOWN);
     return 0;
   }
-  for (auto [key, field] : {std::pair{"command", &description.command},
-                            std::pair{"display_name", &description.display_name},
-                            std::pair{"package", &description.package}}) {
+  for (auto [key, field] :
+       {std::pair{"command", &description.command},
+        std::pair{"display_name", &description.display_name},
+        std::pair{"package", &description.package}, std::pair{"user", &description.user},
+        std::pair{"stop_signal", &description.stop_signal},
+        std::pair{"stop_timeout", &description.stop_timeout}}) {
     if (ConfRead(path, key, *field) < 0) return -1;
   }
   if (description.display_name.empty()) description.display_name = name;

@@ -7,6 +7,14 @@
 //                 environment PATH, LANG and KOVA_ROOT
 //   display_name  the name shown to users (default: the service's name)
 //   package       the package the service belongs to, if any
+//   user          the account the service runs as when the platform is root
+//                 (its uid, primary gid and groups); root when unset. A caller
+//                 that is not root starts services with its own ids.
+//   stop_signal   the signal that stops the service (HUP, INT, QUIT, TERM, USR1
+//                 or USR2, "SIG" in front allowed), sent to its main process
+//                 alone; unset, SIGTERM goes to the service's whole process group
+//   stop_timeout  seconds (1 to 3600, default 5) the service has to end after
+//                 the stop signal before its process group gets SIGKILL
 // A started service is recorded in /run/kova/<name>.pid as "<pid> <start time>".
 // The service of a package <pkg> is "pkgctl-<pkg>"; it is known to the system
 // while /var/packages/<pkg> exists, even without a file of its own.
@@ -24,6 +32,9 @@ struct ServiceDescription {
   std::string command;
   std::string display_name;
   std::string package;
+  std::string user;
+  std::string stop_signal;
+  std::string stop_timeout;
 };
 
 // Reads the description of service `name`. Returns 1 when the service is known,

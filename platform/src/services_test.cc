@@ -1,8 +1,12 @@
+#include <grp.h>
 #include <gtest/gtest.h>
+#include <pwd.h>
 #include <signal.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
+#include <fstream>
 #include <string>
 #include <thread>
 
@@ -97,13 +101,25 @@ TEST_F(ServicesTest, ServicesThatCannotStartSayWhy) {
   root_.Write("/etc/kova/services/missing.conf", "command=\"/nonexistent/daemon\"\n");
   root_.Write("/etc/kova/services/nocommand.conf", "display_name=\"Nothing to run\"\n");
   root_.Write("/etc/kova/services/open.conf", "command=/bin/sh \"-c\n");
+  root_.Write("/etc/kova/services/ghost.conf",
+              "command=\"/bin/sleep 300\"\nuser=\"kova-no-such-account\"\n");
+  root_.Write("/etc/kova/services/kill.conf", "command=\"/bin/sleep 300\"\nstop_signal=KILL\n");
+  root_.Write("/etc/kova/services/zero.conf", "command=\"/bin/sleep 300\"\nstop_timeout=0\n");
+  root_.Write("/etc/kova/services/unit.conf", "command=\"/bin/sleep 300\"\nstop_timeout=5s\n");
   const struct {
     const char* name;
     int error;
   } cases[] = {
-      {"unknown", KOVA_ERR_SERVICE_UNKNOWN}, {"../demo", KOVA_ERR_INVALID},
-      {"relative", KOVA_ERR_FORMAT},         {"open", KOVA_ERR_FORMAT},
-      {"missing", KOVA_ERR_SERVICE_FAILED},  {"nocommand", KOVA_ERR_SERVICE_UNKNOWN},
+      {"unknown", KOVA_ERR_SERVICE_UNKNOWN},
+      {"../demo", KOVA_ERR_INVALID},
+      {"relative", KOVA_ERR_FORMAT},
+      {"open", KOVA_ERR_FORMAT},
+      {"missing", KOVA_ERR_SERVICE_FAILED},
+      {"nocommand", KOVA_ERR_SERVICE_UNKNOWN},
+      {"ghost", KOVA_ERR_NOT_FOUND},
+      {"kill", KOVA_ERR_FORMAT},
+      {"zero", KOVA_ERR_FORMAT},
+      {"unit", KOVA_ERR_FORMAT},
   };
   for (const auto& c : cases) {
     EXPECT_LT(QLIBServiceStart(c.name, 0), 0) << c.name;
@@ -111,6 +127,85 @@ TEST_F(ServicesTest, ServicesThatCannotStartSayWhy) {
     EXPECT_EQ(QLIBServiceIsRunning(c.name), 0) << c.name;
   }
   EXPECT_LT(QLIBServiceStart(nullptr, 0), 0);
+}
+
+// The "Uid:", "Gid:" and "Groups:" lines of /proc/<pid>/status.
+std::string StatusIds(pid_t pid) {
+  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+  std::string out;
+  for (std::string line; std::getline(status, line);) {
+    if (line.starts_with("Uid:") || line.starts_with("Gid:") || line.starts_with("Groups:")) {
+      out += line + "\n";
+    }
+  }
+  return out;
+}
+
+// Started by root, a service runs with its account's uid, gid and groups, as
+// the user database has them; started by anyone else, with the caller's ids.
+TEST_F(ServicesTest, RunsWithTheIdsOfItsAccount) {
+  // postgres has a supplementary group on Debian; nobody is there everywhere.
+  const char* account = getpwnam("postgres") != nullptr ? "postgres" : "nobody";
+  root_.Write("/etc/kova/services/demo.conf",
+              "command=\"/bin/sleep 300\"\nuser=\"" + std::string(account) + "\"\n");
+  ASSERT_EQ(QLIBServiceStart("demo", 0), 0);
+  std::string expected = StatusIds(getpid());
+  if (geteuid() == 0) {
+    const passwd* entry = getpwnam(account);
+    gid_t groups[64];
+    int count = 64;
+    ASSERT_GE(getgrouplist(account, entry->pw_gid, groups, &count), 0);
+    std::sort(groups, groups + count);  // the kernel keeps them sorted
+    const std::string uid = "\t" + std::to_string(entry->pw_uid);
+    const std::string gid = "\t" + std::to_string(entry->pw_gid);
+    expected = "Uid:" + uid + uid + uid + uid + "\nGid:" + gid + gid + gid + gid + "\nGroups:\t";
+    for (int i = 0; i < count; ++i)
+      expected += std::to_string(groups[i]) + (i + 1 < count ? " " : "");
+    expected += " \n";
+  }
+  EXPECT_EQ(StatusIds(Recorded().pid), expected);
+  ASSERT_EQ(QLIBServiceStop("demo", 0), 0);
+}
+
+// The stop signal goes to the main process alone; its group gets SIGKILL once
+// the main process has ended, or once the grace is over. (USR1 and not INT: a
+// shell's background job can't catch SIGINT.)
+TEST_F(ServicesTest, StopSignalReachesTheMainProcessOnly) {
+  root_.Write("/opt/family.sh", R"sh(log="$KOVA_ROOT/signals"
+(trap 'echo child USR1 >> "$log"' USR1; : > "$KOVA_ROOT/child_ready"
+ while :; do sleep 0.05; done) &
+echo $! > "$KOVA_ROOT/child"
+# The main process ends a little after the signal: time for the child to note one.
+trap 'echo main USR1 >> "$log"; [ "$1" = stay ] || { sleep 0.3; exit 0; }' USR1
+while :; do sleep 0.05; done
+)sh");
+  const struct {
+    const char* keys;
+    const char* main;  // "exit" or "stay" on the stop signal
+    milliseconds least;
+  } cases[] = {
+      {"stop_signal=\"USR1\"\n", "exit", milliseconds(0)},
+      {"stop_signal=SIGUSR1\nstop_timeout=1\n", "stay", milliseconds(1000)},
+  };
+  for (const auto& c : cases) {
+    for (const char* file : {"/signals", "/child_ready"}) unlink(root_.Path(file).c_str());
+    root_.Write(
+        "/etc/kova/services/demo.conf",
+        "command=\"/bin/sh " + root_.Path("/opt/family.sh") + " " + c.main + "\"\n" + c.keys);
+    ASSERT_EQ(QLIBServiceStart("demo", 0), 0) << c.keys;
+    const kova::ProcessIdentity main = Recorded();
+    ASSERT_TRUE(Eventually([&] { return access(root_.Path("/child_ready").c_str(), F_OK) == 0; }));
+    kova::ProcessIdentity child{std::stoi(root_.Read("/child")), 0};
+    ASSERT_TRUE(kova::ReadProcessStart(child.pid, child.start_time));
+    const auto start = std::chrono::steady_clock::now();
+    ASSERT_EQ(QLIBServiceStop("demo", 0), 0) << c.keys;
+    const auto took = std::chrono::steady_clock::now() - start;
+    EXPECT_GE(took, c.least) << c.keys;
+    EXPECT_LT(took, milliseconds(4000)) << c.keys;  // well before the default grace of 5 s
+    EXPECT_FALSE(kova::IsAlive(main)) << c.keys;
+    EXPECT_TRUE(Eventually([&] { return !kova::IsAlive(child); })) << c.keys;
+    EXPECT_EQ(root_.Read("/signals"), "main USR1\n") << c.keys;
+  }
 }
 
 TEST_F(ServicesTest, DisplayNames) {
@@ -170,7 +265,7 @@ TEST(ServiceProcessTest, TerminateKillsWhatIgnoresTerm) {
   kova::ProcessIdentity process;
   ASSERT_TRUE(kova::LaunchDetached(
       {"/bin/sh", "-c", "trap '' TERM; : > \"$0\"; while :; do sleep 0.05; done", ready},
-      {"PATH=/usr/bin:/bin"}, process));
+      {"PATH=/usr/bin:/bin"}, nullptr, process));
   ASSERT_TRUE(Eventually([&] { return access(ready.c_str(), F_OK) == 0; }));  // TERM ignored now
   const auto start = std::chrono::steady_clock::now();
   EXPECT_TRUE(kova::Terminate(process, milliseconds(300)));

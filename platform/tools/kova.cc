@@ -177,8 +177,15 @@ int Service(const Args& args) {
   };
   auto action = actions.find(verb);
   if (action == actions.end()) return Usage(kServiceHelp, false);
-  if (action->second() < 0) return Fail("cannot " + verb + " " + name);
-  return 0;
+  if (action->second() >= 0) return 0;
+  kova::ServiceDescription description;
+  if (verb == "start" && QLIBCErrGet() == KOVA_ERR_NOT_FOUND &&
+      kova::DescribeService(name, description) > 0 && !description.user.empty()) {
+    fprintf(stderr, "kova: cannot start %s: its account %s does not exist\n", name,
+            description.user.c_str());
+    return kFailed;
+  }
+  return Fail("cannot " + verb + " " + name);
 }
 
 constexpr char kLogHelp[] =

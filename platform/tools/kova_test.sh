@@ -45,6 +45,9 @@ expect 0 'sleeper running' service status sleeper
 expect 0 '^$' service stop sleeper
 expect 3 'sleeper stopped' service status sleeper
 expect 1 'cannot start ghost: no such service is described' service start ghost
+printf 'command="/bin/sleep 300"\nuser="kova-no-such-account"\n' \
+  >"$KOVA_ROOT/etc/kova/services/orphan.conf"
+expect 1 'cannot start orphan: its account kova-no-such-account does not exist' service start orphan
 expect 2 'usage: kova service' service restart sleeper
 
 expect 0 'usage: kova log' log --help

@@ -26,6 +26,11 @@ for candidate in "$(dirname "$0")"/*/"$name.conf"; do
   [ -f "$candidate" ] && description=$candidate
 done
 [ -n "$description" ] || { echo "install-service.sh: no daemon here is named $name" >&2; exit 1; }
+# A service with an installer of its own needs more than its description.
+if [ -x "$(dirname "$description")/install-service.sh" ]; then
+  echo "install-service.sh: $name has its own: $(dirname "$description")/install-service.sh" >&2
+  exit 1
+fi
 program=${1:-}
 [ $# -gt 0 ] && shift
 [ -n "$program" ] || program=$root/usr/sbin/$name

@@ -45,8 +45,8 @@ std::string Exchange(const std::string& path, const std::string& request) {
 
 class SocketServerTest : public ::testing::Test {
  protected:
-  std::string path_ = root_.Path("/statd.sock");
   kova_test::TestRoot root_;
+  std::string path_ = root_.Path("/statd.sock");
 };
 
 TEST_F(SocketServerTest, AnswersOneLinePerConnection) {

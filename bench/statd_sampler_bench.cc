@@ -11,7 +11,6 @@
 #include <benchmark/benchmark.h>
 #include <dirent.h>
 #include <fcntl.h>
-#include <ftw.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -25,34 +24,16 @@
 #include "sampling/proc_reader.h"
 #include "sampling/proc_text.h"
 #include "statd/sampler.h"
+#include "test_support/bench_root.h"
 #include "test_support/recorded_proc.h"
 
 namespace statd {
 namespace {
 
+using kova_test::BenchRoot;
+
 constexpr double kBudgetMicroseconds = 10000;  // 1 % of a core at 1 Hz
 const kova_test::RecordedMachine kShape;       // the defaults: 16 CPUs, 8 disks...
-
-// A temporary system root that KOVA_ROOT names while it lives.
-class BenchRoot {
- public:
-  BenchRoot() {
-    char pattern[] = "/tmp/statd_sampler_bench.XXXXXX";
-    if (mkdtemp(pattern) != nullptr) path_ = pattern;
-    setenv("KOVA_ROOT", path_.c_str(), 1);
-  }
-  ~BenchRoot() {
-    unsetenv("KOVA_ROOT");
-    if (path_.empty()) return;
-    nftw(
-        path_.c_str(), [](const char* file, const struct stat*, int, FTW*) { return remove(file); },
-        16, FTW_DEPTH | FTW_PHYS);
-  }
-  const std::string& path() const { return path_; }
-
- private:
-  std::string path_;
-};
 
 // Series the recorded machine has each cycle once its counters grow: CPU (all
 // and each), load, memory, interfaces, disks, volumes, services, LUNs.

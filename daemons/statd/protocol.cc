@@ -11,6 +11,8 @@
 #include <sstream>
 #include <vector>
 
+#include "statd/json_out.h"
+
 namespace statd {
 namespace {
 
@@ -20,11 +22,13 @@ constexpr int64_t kLatestTime = int64_t{1} << 40;  // far beyond any clock
 constexpr int64_t kDefaultPoints = 600;
 constexpr int64_t kMaxPoints = 10000;
 
-// What a request came to: data, or an error code and its message.
+// What a request came to: data (as a value, or as JSON text already written),
+// or an error code and its message.
 struct Outcome {
   const char* error = nullptr;
   std::string message;
   Json::Value data;
+  std::string text;
 
   bool Fail(const char* code, std::string text) {
     error = code;
@@ -118,25 +122,6 @@ bool Catalog(const Json::Value&, Collector& collector, Outcome& outcome) {
   return true;
 }
 
-template <typename T>
-Json::Value Array(const std::vector<T>& items) {
-  Json::Value array(Json::arrayValue);
-  array.resize(static_cast<Json::ArrayIndex>(items.size()));
-  for (size_t i = 0; i < items.size(); ++i) {
-    array[static_cast<Json::ArrayIndex>(i)] = static_cast<Json::Value>(items[i]);
-  }
-  return array;
-}
-
-Json::Value Array(const std::vector<int64_t>& items) {
-  Json::Value array(Json::arrayValue);
-  array.resize(static_cast<Json::ArrayIndex>(items.size()));
-  for (size_t i = 0; i < items.size(); ++i) {
-    array[static_cast<Json::ArrayIndex>(i)] = static_cast<Json::Int64>(items[i]);
-  }
-  return array;
-}
-
 bool Realtime(const Json::Value& request, Collector& collector, Outcome& outcome) {
   std::vector<std::string> ids;
   int64_t since = 0;
@@ -148,18 +133,20 @@ bool Realtime(const Json::Value& request, Collector& collector, Outcome& outcome
   std::vector<std::string> unknown;
   int64_t now = 0;
   collector.Realtime(ids, since, found, unknown, now);
-  Json::Value& data = outcome.data;
-  data["interval"] = collector.interval();
-  data["now"] = static_cast<Json::Int64>(now);
-  Json::Value& list = data["series"] = Json::arrayValue;
+  JsonOut data(outcome.text);
+  data.BeginObject();
+  data.Key("interval").Number(int64_t{collector.interval()});
+  data.Key("now").Number(now);
+  data.Key("series").BeginArray();
   for (const RealtimeSeries& series : found) {
-    Json::Value item;
-    item["id"] = series.id;
-    item["times"] = Array(series.times);
-    item["values"] = Array(series.values);
-    list.append(std::move(item));
+    data.BeginObject().Key("id").Text(series.id);
+    data.Key("times").Array(series.times);
+    data.Key("values").Array(series.values);
+    data.EndObject();
   }
-  data["unknown"] = Array(unknown);
+  data.EndArray();
+  data.Key("unknown").Array(unknown);
+  data.EndObject();
   return true;
 }
 
@@ -181,21 +168,22 @@ bool History(const Json::Value& request, Collector& collector, Outcome& outcome)
   if (!collector.history().Query(ids, from, to, static_cast<int>(points), answer, error)) {
     return outcome.Fail("database_unavailable", error);
   }
-  Json::Value& data = outcome.data;
-  data["from"] = static_cast<Json::Int64>(from);
-  data["to"] = static_cast<Json::Int64>(to);
-  data["step"] = static_cast<Json::Int64>(answer.step);
-  data["source"] = answer.source;
-  Json::Value& list = data["series"] = Json::arrayValue;
+  JsonOut data(outcome.text);
+  data.BeginObject();
+  data.Key("from").Number(from);
+  data.Key("to").Number(to);
+  data.Key("step").Number(answer.step);
+  data.Key("source").Text(answer.source);
+  data.Key("series").BeginArray();
   for (const HistorySeries& series : answer.series) {
-    Json::Value item;
-    item["id"] = series.id;
-    item["times"] = Array(series.times);
-    item["avg"] = Array(series.avg);
-    item["min"] = Array(series.min);
-    item["max"] = Array(series.max);
-    list.append(std::move(item));
+    data.BeginObject().Key("id").Text(series.id);
+    data.Key("times").Array(series.times);
+    data.Key("avg").Array(series.avg);
+    data.Key("min").Array(series.min);
+    data.Key("max").Array(series.max);
+    data.EndObject();
   }
+  data.EndArray().EndObject();
   return true;
 }
 
@@ -235,10 +223,15 @@ std::string AnswerOf(std::string_view line, Collector& collector) {
     Outcome outcome;
     if (!row->handle(request, collector, outcome))
       return ErrorAnswer(outcome.error, outcome.message);
-    Json::Value answer;
-    answer["success"] = true;
-    if (!outcome.data.isNull()) answer["data"] = std::move(outcome.data);
-    std::string text = Write(answer);
+    std::string text;
+    if (!outcome.text.empty()) {
+      text = "{\"success\":true,\"data\":" + outcome.text + "}";
+    } else {
+      Json::Value answer;
+      answer["success"] = true;
+      if (!outcome.data.isNull()) answer["data"] = std::move(outcome.data);
+      text = Write(answer);
+    }
     if (text.size() > kMaxAnswer) {
       return ErrorAnswer("too_large", "the answer would be over 16 MiB; ask for less");
     }

@@ -113,7 +113,7 @@ TEST_F(ProtocolTest, RealtimeAnswersTheSamplesAfterATimeInTheOrderAsked) {
       Ask(R"({"request":"realtime","series":["net.rx_bytes@eth0","nope","cpu.user"],"since":100})");
   ASSERT_EQ(answer["success"], true) << answer;
   EXPECT_EQ(answer["data"], ParseJson(R"({"interval":1,"now":102,"unknown":["nope"],"series":[
-                {"id":"net.rx_bytes@eth0","times":[102],"values":[30.0]},
+                {"id":"net.rx_bytes@eth0","times":[102],"values":[30]},
                 {"id":"cpu.user","times":[101,102],"values":[2.5,3.5]}]})"));
 }
 
@@ -149,7 +149,7 @@ TEST_F(ProtocolTest, HistoryIsAskedOnlyWhileItIsOnAndItsFailureIsNamed) {
   EXPECT_EQ(Ask(line)["error"]["code"], "history_off");
   Settings("resourcemonitor_history=\"yes\"\n");
   EXPECT_EQ(Ask(line)["data"], ParseJson(R"({"from":60,"to":3600,"step":60,"source":"minute",
-      "series":[{"id":"cpu.user","times":[60],"avg":[1.5],"min":[1.0],"max":[2.0]}]})"));
+      "series":[{"id":"cpu.user","times":[60],"avg":[1.5],"min":[1],"max":[2]}]})"));
   EXPECT_EQ(history_.asked, (std::vector<int64_t>{60, 3600, 600}));
   history_.reachable = false;
   const Json::Value failed = Ask(line);

@@ -41,8 +41,9 @@ void Collector::Record(int64_t time, const std::vector<SeriesValue>& values) {
 CatalogAnswer Collector::Catalog() const {
   CatalogAnswer answer;
   answer.interval = interval_;
-  answer.history_state = history_.State();
+  // Under the lock, so that the state belongs to the settings read with it.
   std::lock_guard lock(mutex_);
+  answer.history_state = history_.State();
   answer.realtime_minutes = settings_.realtime_minutes;
   answer.history_enabled = settings_.history.enabled;
   answer.series = store_.Catalog();

@@ -16,12 +16,15 @@
 #include <string>
 #include <thread>
 
-#include "kova/transmitor.h"
 #include "test_support/bench_root.h"
+#include "test_support/collector_client.h"
 #include "test_support/host_call.h"
 #include "test_support/recorded_proc.h"
 
 namespace {
+
+using kova_test::AskCollector;
+using kova_test::AskCollectorUntil;
 
 constexpr size_t kShortRing = 15 * 60;
 constexpr size_t kRingSeconds = 120 * 60;
@@ -37,27 +40,6 @@ double StatusMiB(pid_t pid, const char* key) {
   }
   fclose(status);
   return kib / 1024;
-}
-
-Json::Value Ask(const std::string& request) {
-  Transmitor client("localhost");
-  Json::Value reply;
-  if (client.Transmit(kova_test::ParseJson(request)) != 0 || client.GetDataJson(reply) != 0) {
-    return Json::Value();
-  }
-  return reply;
-}
-
-// Asks `request` every 100 ms until `done` holds, for up to `limit`.
-template <typename Done>
-Json::Value AskUntil(const std::string& request, Done done, std::chrono::seconds limit) {
-  const auto deadline = std::chrono::steady_clock::now() + limit;
-  Json::Value reply = Ask(request);
-  while (!done(reply) && std::chrono::steady_clock::now() < deadline) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(100));
-    reply = Ask(request);
-  }
-  return reply;
 }
 
 }  // namespace
@@ -92,14 +74,15 @@ int main() {
       return reply["data"]["series"][0]["times"].size() >= samples;
     };
   };
-  const Json::Value short_ring = AskUntil(ask, holding(kShortRing), std::chrono::seconds(60));
+  const Json::Value short_ring =
+      AskCollectorUntil(ask, holding(kShortRing), std::chrono::seconds(60));
   const double baseline = StatusMiB(daemon, "VmRSS:");
   kova_test::WriteFile(settings, "resourcemonitor_realtime_max=\"120\"\n");
-  const bool reloaded = Ask(R"({"request":"reload"})")["success"].asBool();
-  const Json::Value ring = AskUntil(ask, holding(kRingSeconds), std::chrono::seconds(300));
+  const bool reloaded = AskCollector(R"({"request":"reload"})")["success"].asBool();
+  const Json::Value ring = AskCollectorUntil(ask, holding(kRingSeconds), std::chrono::seconds(300));
   const double resident = StatusMiB(daemon, "VmRSS:");
   const double peak = StatusMiB(daemon, "VmHWM:");
-  const Json::Value catalog = Ask(R"({"request":"catalog"})");
+  const Json::Value catalog = AskCollector(R"({"request":"catalog"})");
   done = true;
   counters.join();
   kill(daemon, SIGTERM);

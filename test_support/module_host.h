@@ -14,6 +14,7 @@
 
 #include "kova/webapi.h"
 #include "test_support/host_call.h"
+#include "test_support/module_tables.h"
 #include "test_support/run_in_child.h"
 
 namespace kova_test {
@@ -38,13 +39,7 @@ class ModuleHost {
   // Calls `method` of `api` through the loaded module's table.
   KOVA::APIResponse Call(const char* api, const char* method, const std::string& params = "{}",
                          const std::string& language = "enu") const {
-    for (const APITableEntry* row = table_; row != nullptr && row->api != nullptr; ++row) {
-      if (std::string(row->api) == api && std::string(row->method) == method) {
-        return CallHandler(row->handler, params, language);
-      }
-    }
-    ADD_FAILURE() << api << " " << method << " not in the table";
-    return KOVA::APIResponse();
+    return CallThroughTable(table_, api, method, params, language);
   }
 
  private:

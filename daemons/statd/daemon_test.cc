@@ -15,12 +15,14 @@
 #include <thread>
 #include <vector>
 
-#include "kova/transmitor.h"
+#include "test_support/collector_client.h"
 #include "test_support/host_call.h"
 #include "test_support/test_root.h"
 
 namespace {
 
+using kova_test::AskCollector;
+using kova_test::AskCollectorUntil;
 using ::testing::HasSubstr;
 
 // kovastatd started with `args`, its standard error into `log`; killed when
@@ -72,28 +74,6 @@ class Statd {
   int status_ = -1;
 };
 
-// One exchange with the collector; the reply, or null when there was none.
-Json::Value Ask(const std::string& request) {
-  Transmitor client("localhost");
-  Json::Value reply;
-  if (client.Transmit(kova_test::ParseJson(request)) != 0 || client.GetDataJson(reply) != 0) {
-    return Json::Value();
-  }
-  return reply;
-}
-
-// Asks `request` until `done` holds of the reply, for up to 10 s.
-Json::Value AskUntil(const std::string& request,
-                     const std::function<bool(const Json::Value&)>& done) {
-  Json::Value reply;
-  for (int i = 0; i < 100; ++i) {
-    reply = Ask(request);
-    if (done(reply)) break;
-    std::this_thread::sleep_for(std::chrono::milliseconds(100));
-  }
-  return reply;
-}
-
 std::string Read(const std::string& path) {
   std::ifstream in(path);
   return std::string(std::istreambuf_iterator<char>(in), {});
@@ -128,9 +108,9 @@ TEST(StatdDaemon, AnswersOnItsSocketReadsItsSettingsAgainAndStopsCleanly) {
   // No database: history waits for one.
   Statd statd({"--log-stderr", "--database", "host=" + root.Path("/nowhere") + " dbname=none"},
               log);
-  const Json::Value catalog = AskUntil(R"({"request":"catalog"})", [](const Json::Value& reply) {
-    return reply["data"]["series"].size() > 0;
-  });
+  const Json::Value catalog = AskCollectorUntil(
+      R"({"request":"catalog"})",
+      [](const Json::Value& reply) { return reply["data"]["series"].size() > 0; });
   ASSERT_EQ(catalog["success"], true) << Read(log);
   EXPECT_EQ(catalog["data"]["realtime_minutes"], 15);
   EXPECT_EQ(catalog["data"]["history"]["state"], "off");
@@ -141,8 +121,9 @@ TEST(StatdDaemon, AnswersOnItsSocketReadsItsSettingsAgainAndStopsCleanly) {
   EXPECT_TRUE(has_memory) << catalog;
 
   // A request it can't take gets an error, and the collector goes on.
-  EXPECT_EQ(Ask(R"({"request":"realtime","series":"mem.total"})")["error"]["code"], "bad_request");
-  const Json::Value samples = Ask(R"({"request":"realtime","series":["mem.total"]})");
+  EXPECT_EQ(AskCollector(R"({"request":"realtime","series":"mem.total"})")["error"]["code"],
+            "bad_request");
+  const Json::Value samples = AskCollector(R"({"request":"realtime","series":["mem.total"]})");
   ASSERT_EQ(samples["data"]["series"].size(), 1u) << samples;
   EXPECT_GT(samples["data"]["series"][0]["values"][0].asDouble(), 0);
 
@@ -150,15 +131,15 @@ TEST(StatdDaemon, AnswersOnItsSocketReadsItsSettingsAgainAndStopsCleanly) {
   root.Write("/etc/kovainfo.conf",
              "resourcemonitor_realtime_max=\"60\"\nresourcemonitor_history=\"yes\"\n");
   kill(statd.pid(), SIGHUP);
-  const Json::Value reloaded = AskUntil(R"({"request":"catalog"})", [](const Json::Value& reply) {
-    return reply["data"]["realtime_minutes"] == 60;
-  });
+  const Json::Value reloaded = AskCollectorUntil(
+      R"({"request":"catalog"})",
+      [](const Json::Value& reply) { return reply["data"]["realtime_minutes"] == 60; });
   EXPECT_EQ(reloaded["data"]["history"],
             kova_test::ParseJson(R"({"enabled":true,"state":"waiting"})"))
       << reloaded;
   root.Write("/etc/kovainfo.conf", "resourcemonitor_realtime_max=\"30\"\n");
-  EXPECT_EQ(Ask(R"({"request":"reload"})"), kova_test::ParseJson(R"({"success":true})"));
-  EXPECT_EQ(Ask(R"({"request":"catalog"})")["data"]["realtime_minutes"], 30);
+  EXPECT_EQ(AskCollector(R"({"request":"reload"})"), kova_test::ParseJson(R"({"success":true})"));
+  EXPECT_EQ(AskCollector(R"({"request":"catalog"})")["data"]["realtime_minutes"], 30);
 
   kill(statd.pid(), SIGTERM);
   EXPECT_EQ(statd.Wait(std::chrono::seconds(5)), 0) << Read(log);

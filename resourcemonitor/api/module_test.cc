@@ -1,6 +1,5 @@
 // Loads the built module the way the host does and calls it through its tables.
 
-#include <dlfcn.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
@@ -10,6 +9,7 @@
 #include "fake/kova_fake.h"
 #include "kova/webapi.h"
 #include "test_support/host_call.h"
+#include "test_support/module_tables.h"
 #include "test_support/run_in_child.h"
 
 namespace {
@@ -18,39 +18,15 @@ using kova_test::ParseJson;
 using kova_test::RunInChild;
 using ::testing::ElementsAre;
 
-struct Module {
-  APITableEntry* table = nullptr;
-  APICheckEntry* checks = nullptr;
-};
+using Module = kova_test::ModuleTables;
 
 // Loads the module in this process; each test does so in a child of its own,
 // so that every test starts from a freshly loaded module.
-Module Load() {
-  Module module;
-  void* handle = dlopen(KOVA_MODULE_PATH, RTLD_NOW | RTLD_LOCAL);
-  EXPECT_NE(handle, nullptr) << dlerror();
-  if (handle == nullptr) return module;
-  auto get_table = reinterpret_cast<GetAPITableFunc>(dlsym(handle, kGetAPITableSymbol));
-  auto get_checks = reinterpret_cast<GetAPICheckTableFunc>(dlsym(handle, kGetAPICheckTableSymbol));
-  EXPECT_NE(get_table, nullptr);
-  EXPECT_NE(get_checks, nullptr);
-  if (get_table == nullptr || get_checks == nullptr) return module;
-  module.table = get_table();
-  module.checks = get_checks();
-  EXPECT_EQ(dlsym(handle, "gTable"), module.table);
-  EXPECT_EQ(dlsym(handle, "gCheckTable"), module.checks);
-  return module;
-}
+Module Load() { return kova_test::LoadModuleTables(KOVA_MODULE_PATH); }
 
 KOVA::APIResponse Call(const Module& module, const char* api, const char* method,
                        const std::string& params) {
-  for (const APITableEntry* row = module.table; row->api != nullptr; ++row) {
-    if (std::string(row->api) == api && std::string(row->method) == method) {
-      return kova_test::CallHandler(row->handler, params);
-    }
-  }
-  ADD_FAILURE() << api << " " << method << " not in the table";
-  return KOVA::APIResponse();
+  return kova_test::CallThroughTable(module.table, api, method, params);
 }
 
 std::string Name(const char* api, intptr_t version, const char* method) {

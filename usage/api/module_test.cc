@@ -1,6 +1,5 @@
 // Loads the built module the way the host does and calls it through its tables.
 
-#include <dlfcn.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
@@ -10,6 +9,7 @@
 #include "fake/kova_fake.h"
 #include "kova/webapi.h"
 #include "test_support/host_call.h"
+#include "test_support/module_tables.h"
 #include "test_support/run_in_child.h"
 
 namespace {
@@ -18,28 +18,11 @@ using kova_test::ParseJson;
 using kova_test::RunInChild;
 using ::testing::ElementsAre;
 
-struct Module {
-  APITableEntry* table = nullptr;
-  APICheckEntry* checks = nullptr;
-};
+using Module = kova_test::ModuleTables;
 
-// Loads the module in this process; each test does so in a child of its own.
-Module Load() {
-  Module module;
-  void* handle = dlopen(KOVA_MODULE_PATH, RTLD_NOW | RTLD_LOCAL);
-  EXPECT_NE(handle, nullptr) << dlerror();
-  if (handle == nullptr) return module;
-  auto get_table = reinterpret_cast<GetAPITableFunc>(dlsym(handle, kGetAPITableSymbol));
-  auto get_checks = reinterpret_cast<GetAPICheckTableFunc>(dlsym(handle, kGetAPICheckTableSymbol));
-  EXPECT_NE(get_table, nullptr);
-  EXPECT_NE(get_checks, nullptr);
-  if (get_table == nullptr || get_checks == nullptr) return module;
-  module.table = get_table();
-  module.checks = get_checks();
-  EXPECT_EQ(dlsym(handle, "gTable"), module.table);
-  EXPECT_EQ(dlsym(handle, "gCheckTable"), module.checks);
-  return module;
-}
+// Loads the module in this process; each test does so in a child of its own,
+// so that every test starts from a freshly loaded module.
+Module Load() { return kova_test::LoadModuleTables(KOVA_MODULE_PATH); }
 
 TEST(UsageModuleTest, TablesListTheThreeMethodsAndNoChecks) {
   EXPECT_TRUE(RunInChild([] {
@@ -87,10 +70,8 @@ TEST(UsageModuleTest, AnswersThroughTheTable) {
       }
       Module module = Load();
       ASSERT_NE(module.table, nullptr);
-      const APITableEntry* row = module.table;
-      while (row->method != nullptr && std::string(row->method) != c.method) ++row;
-      ASSERT_NE(row->handler, nullptr) << c.method;
-      const KOVA::APIResponse response = kova_test::CallHandler(row->handler, c.params);
+      const KOVA::APIResponse response = kova_test::CallThroughTable(
+          module.table, "KOVA.ResourceMonitor.Usage", c.method, c.params);
       EXPECT_EQ(response.GetErrorCode(), c.code);
       EXPECT_EQ(response.GetData(), ParseJson(c.data));
     })) << c.method;

@@ -234,8 +234,10 @@ int main(int argc, char** argv) {
     const double slow = reporter.Median(name);
     measured = measured && slow > 0;
     if (fast > 0 && slow > 0) {
-      printf("median %s: %.2f ms: the partitioned store is %.1f times faster\n", name.c_str(), slow,
-             slow / fast);
+      printf(
+          "median %s: %.2f ms: %s : partitioned = %.2f (above 1: the partitioned store is "
+          "faster)\n",
+          name.c_str(), slow, baseline->schema, slow / fast);
     }
   }
   if (!measured) {

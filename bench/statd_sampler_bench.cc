@@ -35,13 +35,6 @@ using kova_test::BenchRoot;
 constexpr double kBudgetMicroseconds = 10000;  // 1 % of a core at 1 Hz
 const kova_test::RecordedMachine kShape;       // the defaults: 16 CPUs, 8 disks...
 
-// Series the recorded machine has each cycle once its counters grow: CPU (all
-// and each), load, memory, interfaces, disks, volumes, services, LUNs.
-size_t RecordedSeries() {
-  return 5 * (kShape.cpus + 1) + 3 + 5 + 6 * kShape.interfaces + 6 * kShape.disks +
-         3 * kShape.volumes + 2 * kShape.services + 2 * kShape.luns;
-}
-
 // Reads the file `path` whole into a scratch buffer; false when it can't.
 bool ReadWhole(int dir, const char* path) {
   static char buffer[1 << 16];
@@ -91,9 +84,9 @@ void BM_Cycle_Recorded(benchmark::State& state) {
     state.ResumeTiming();
     series = sampler->Cycle().size();
   }
-  if (series != RecordedSeries()) {
+  if (series != kShape.Series()) {
     state.SkipWithError(
-        ("expected " + std::to_string(RecordedSeries()) + " series, got " + std::to_string(series))
+        ("expected " + std::to_string(kShape.Series()) + " series, got " + std::to_string(series))
             .c_str());
   }
   state.counters["series"] = static_cast<double>(series);

@@ -187,6 +187,13 @@ struct RecordedMachine {
   int processes = 1000;  // in all, the services' included
   int volumes = 2;       // /volume1...; volume N mounted from the Nth disk's partition
   int luns = 4;          // lun-0...; on the volumes in turn
+
+  // The series kovastatd keeps of such a machine once its counters grow: CPU
+  // (all and each), load, memory, interfaces, disks, volumes, services, LUNs.
+  size_t Series() const {
+    return static_cast<size_t>(5 * (cpus + 1) + 3 + 5 + 6 * interfaces + 6 * disks + 3 * volumes +
+                               2 * services + 2 * luns);
+  }
 };
 
 // The counters of `shape` after `pass` seconds: stat, diskstats and net/dev

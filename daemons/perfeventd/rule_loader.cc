@@ -45,29 +45,13 @@ bool LoadEnabledRules(std::vector<Rule>& rules) {
 
 void StoreWatch::Mark() {
   const std::string path = kova::RootPath(kStorePath);
-  database_ = Look(path);
-  journal_ = Look(path + "-wal");
+  database_ = kova::StampOf(path);
+  journal_ = kova::StampOf(path + "-wal");
 }
 
 bool StoreWatch::Changed() const {
   const std::string path = kova::RootPath(kStorePath);
-  return !Same(database_, Look(path)) || !Same(journal_, Look(path + "-wal"));
-}
-
-StoreWatch::FileState StoreWatch::Look(const std::string& path) {
-  struct stat info {};
-  FileState state;
-  if (stat(path.c_str(), &info) != 0) return state;
-  state.exists = true;
-  state.inode = info.st_ino;
-  state.size = info.st_size;
-  state.modified = info.st_mtim;
-  return state;
-}
-
-bool StoreWatch::Same(const FileState& a, const FileState& b) {
-  return a.exists == b.exists && a.inode == b.inode && a.size == b.size &&
-         a.modified.tv_sec == b.modified.tv_sec && a.modified.tv_nsec == b.modified.tv_nsec;
+  return !(database_ == kova::StampOf(path)) || !(journal_ == kova::StampOf(path + "-wal"));
 }
 
 }  // namespace perfeventd

@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "perfeventd/rule.h"
+#include "src/file_stamp.h"
 
 namespace perfeventd {
 
@@ -27,17 +28,8 @@ class StoreWatch {
   bool Changed() const;
 
  private:
-  struct FileState {
-    bool exists = false;
-    ino_t inode = 0;
-    off_t size = 0;
-    timespec modified{};
-  };
-  static FileState Look(const std::string& path);
-  static bool Same(const FileState& a, const FileState& b);
-
-  FileState database_;
-  FileState journal_;
+  kova::FileStamp database_;
+  kova::FileStamp journal_;
 };
 
 }  // namespace perfeventd

@@ -28,12 +28,20 @@ void Collector::Record(int64_t time, const std::vector<SeriesValue>& values) {
   {
     std::lock_guard lock(mutex_);
     if (!store_.Add(time, values)) {
-      // The same second again is dropped; a clock set back starts the ring afresh.
-      if (time >= store_.newest() - 2 * interval_) return;
-      store_.Clear();
+      // The clock was set back: the samples it now shows as future go.
+      store_.DropFrom(time);
       store_.Add(time, values);
     }
     if (settings_.history.enabled) rows = minutes_.Add(time, values);
+  }
+  if (!rows.empty()) history_.Add(std::move(rows));
+}
+
+void Collector::Flush() {
+  std::vector<MinuteRow> rows;
+  {
+    std::lock_guard lock(mutex_);
+    if (settings_.history.enabled) rows = minutes_.Close();
   }
   if (!rows.empty()) history_.Add(std::move(rows));
 }

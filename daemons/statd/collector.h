@@ -48,6 +48,10 @@ class Collector {
   // the minute being gathered; a finished minute's rows go to the history.
   void Record(int64_t time, const std::vector<SeriesValue>& values);
 
+  // Hands the minute gathered so far, while history is on, to the history: at
+  // a stop, so that a restart loses none of it.
+  void Flush();
+
   CatalogAnswer Catalog() const;
 
   // The samples of each known id of `ids` after `since`, in the order asked;

@@ -10,17 +10,20 @@
 #include <set>
 #include <string>
 
+#include "kova/conf.h"
+#include "kova/statistics.h"
+#include "src/file_stamp.h"
 #include "src/system_root.h"
 #include "statd/collector.h"
 #include "statd/pg_history.h"
 #include "statd/protocol.h"
 #include "statd/sampler.h"
+#include "statd/schedule.h"
 #include "statd/socket_server.h"
 
 namespace statd {
 namespace {
 
-constexpr char kSocketPath[] = "/run/kova/statd.sock";
 constexpr char kSpoolDir[] = "/var/lib/kova/statd/spool";
 
 void Log(int priority, const std::string& text) { syslog(priority, "%s", text.c_str()); }
@@ -83,11 +86,13 @@ int RunDaemon(const Options& options) {
   PgHistory history(options.database.empty() ? DefaultDatabase() : options.database,
                     kova::RootPath(kSpoolDir), options.spool_max_bytes, Log, tuning);
   Collector collector(history, options.interval);
+  const std::string settings_path = kova::RootPath(kKovaInfoConf);
+  kova::FileStamp settings = kova::StampOf(settings_path);
   std::string error;
   if (!collector.Reload(error)) Log(LOG_WARNING, error + "; the defaults stand meanwhile");
 
   kova::MakeDirectories(kova::RootPath("/run/kova"), 0755);
-  SocketServer server(kova::RootPath(kSocketPath),
+  SocketServer server(kova::RootPath(kStatisticsSocket),
                       [&collector](std::string_view line) { return Answer(line, collector); });
   if (!server.Start(error)) {
     Log(LOG_ERR, error);
@@ -101,9 +106,9 @@ int RunDaemon(const Options& options) {
   Log(LOG_INFO, "started: a sample every " + std::to_string(options.interval) + " s");
 
   std::set<std::string> unreadable;
-  // Samples fall on whole multiples of the interval.
-  double next = std::floor(clock.Now() / options.interval + 1) * options.interval;
+  double next = NextSampleTime(0, clock.Now(), options.interval);
   for (;;) {
+    next = NextSampleTime(next, clock.Now(), options.interval);
     const double wait = clock.RealUntil(next);
     if (wait > 0) {
       timespec timeout;
@@ -114,6 +119,12 @@ int RunDaemon(const Options& options) {
       if (got == SIGHUP && !collector.Reload(error)) Log(LOG_WARNING, error);
       if (got >= 0 || errno == EINTR) continue;
     }
+    // Settings written without a reload, such as the real-time range, count at once.
+    const kova::FileStamp stamp = kova::StampOf(settings_path);
+    if (!(stamp == settings)) {
+      settings = stamp;
+      if (!collector.Reload(error)) Log(LOG_WARNING, error);
+    }
     std::vector<SeriesValue> values = sampler->Cycle();
     // What can't be read is said once, and again only after it was read.
     const std::set<std::string> now(sampler->Unreadable().begin(), sampler->Unreadable().end());
@@ -122,11 +133,10 @@ int RunDaemon(const Options& options) {
     }
     unreadable = now;
     collector.Record(static_cast<int64_t>(next), values);
-    // A late sample doesn't make up for the missed ones.
     next += options.interval;
-    if (next < clock.Now())
-      next = std::floor(clock.Now() / options.interval + 1) * options.interval;
   }
+  // The minute gathered so far waits in the spool for the database.
+  collector.Flush();
   server.Stop();
   Log(LOG_INFO, "stopped");
   closelog();

@@ -101,7 +101,7 @@ TEST(StatdProgram, RefusesABadCommandLine) {
   }
 }
 
-TEST(StatdDaemon, AnswersOnItsSocketReadsItsSettingsAgainAndStopsCleanly) {
+TEST(StatdDaemon, AnswersOnItsSocketFollowsItsSettingsAndStopsCleanly) {
   kova_test::TestRoot root;
   root.Write("/etc/kovainfo.conf", "resourcemonitor_realtime_max=\"15\"\n");
   const std::string log = root.Path("/statd.err");
@@ -140,6 +140,14 @@ TEST(StatdDaemon, AnswersOnItsSocketReadsItsSettingsAgainAndStopsCleanly) {
   root.Write("/etc/kovainfo.conf", "resourcemonitor_realtime_max=\"30\"\n");
   EXPECT_EQ(AskCollector(R"({"request":"reload"})"), kova_test::ParseJson(R"({"success":true})"));
   EXPECT_EQ(AskCollector(R"({"request":"catalog"})")["data"]["realtime_minutes"], 30);
+  // A setting written without a signal or request (as the module writes the
+  // real-time range) counts at the next sample.
+  root.Write("/etc/kovainfo.conf", "resourcemonitor_realtime_max=\"120\"\n");
+  EXPECT_EQ(AskCollectorUntil(R"({"request":"catalog"})",
+                              [](const Json::Value& reply) {
+                                return reply["data"]["realtime_minutes"] == 120;
+                              })["data"]["realtime_minutes"],
+            120);
 
   kill(statd.pid(), SIGTERM);
   EXPECT_EQ(statd.Wait(std::chrono::seconds(5)), 0) << Read(log);

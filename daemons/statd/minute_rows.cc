@@ -9,12 +9,7 @@ std::vector<MinuteRow> MinuteRows::Add(int64_t time, const std::vector<SeriesVal
   const int64_t minute = time - ((time % 60) + 60) % 60;
   std::vector<MinuteRow> rows;
   if (minute != minute_) {
-    rows.reserve(sums_.size());
-    for (const Sums& sums : sums_) {
-      rows.push_back(MinuteRow{sums.series, minute_, sums.samples, sums.sum / sums.samples,
-                               sums.min, sums.max});
-    }
-    Clear();
+    rows = Close();
     minute_ = minute;
   }
   for (const SeriesValue& value : values) {
@@ -30,6 +25,17 @@ std::vector<MinuteRow> MinuteRows::Add(int64_t time, const std::vector<SeriesVal
     sums.min = std::min(sums.min, value.value);
     sums.max = std::max(sums.max, value.value);
   }
+  return rows;
+}
+
+std::vector<MinuteRow> MinuteRows::Close() {
+  std::vector<MinuteRow> rows;
+  rows.reserve(sums_.size());
+  for (const Sums& sums : sums_) {
+    rows.push_back(
+        MinuteRow{sums.series, minute_, sums.samples, sums.sum / sums.samples, sums.min, sums.max});
+  }
+  Clear();
   return rows;
 }
 

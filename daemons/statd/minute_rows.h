@@ -23,6 +23,10 @@ class MinuteRows {
   // set back) closes the minute as well.
   std::vector<MinuteRow> Add(int64_t time, const std::vector<SeriesValue>& values);
 
+  // Returns the rows of what was gathered so far (a minute not yet whole: its
+  // rows count fewer samples), and forgets it.
+  std::vector<MinuteRow> Close();
+
   // Forgets what was gathered.
   void Clear();
 

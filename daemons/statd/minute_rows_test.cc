@@ -37,14 +37,19 @@ TEST(MinuteRows, AMinutesSamplesBecomeOneRowPerSeriesWhenTheNextMinuteBegins) {
   ExpectRow(next[0], "a", 180, 1, 100, 100, 100);
 }
 
-TEST(MinuteRows, AClockSetBackClosesTheMinuteAndClearForgetsIt) {
+TEST(MinuteRows, AClockSetBackClosesTheMinuteAsCloseDoes) {
   MinuteRows rows;
   rows.Add(600, {Value("a", 2)});
   const std::vector<MinuteRow> done = rows.Add(59, {Value("a", 4)});
   ASSERT_EQ(done.size(), 1u);
   ExpectRow(done[0], "a", 600, 1, 2, 2, 2);
+  // Closing hands over the minute not yet whole; clearing forgets it.
+  const std::vector<MinuteRow> partial = rows.Close();
+  ASSERT_EQ(partial.size(), 1u);
+  ExpectRow(partial[0], "a", 0, 1, 4, 4, 4);
+  rows.Add(1000, {Value("a", 1)});
   rows.Clear();
-  EXPECT_TRUE(rows.Add(1000, {Value("a", 1)}).empty());
+  EXPECT_TRUE(rows.Close().empty());
 }
 
 }  // namespace

@@ -16,12 +16,6 @@
 namespace statd {
 namespace {
 
-constexpr Json::ArrayIndex kMaxSeries = 64;
-constexpr size_t kMaxSeriesId = 256;
-constexpr int64_t kLatestTime = int64_t{1} << 40;  // far beyond any clock
-constexpr int64_t kDefaultPoints = 600;
-constexpr int64_t kMaxPoints = 10000;
-
 // What a request came to: data (as a value, or as JSON text already written),
 // or an error code and its message.
 struct Outcome {
@@ -53,12 +47,14 @@ std::string Write(const Json::Value& value) {
 // "series": 1 to 64 ids.
 bool ReadSeries(const Json::Value& request, std::vector<std::string>& ids, Outcome& outcome) {
   const Json::Value& series = request["series"];
-  if (!series.isArray() || series.empty() || series.size() > kMaxSeries) {
+  if (!series.isArray() || series.empty() || series.size() > kStatisticsMaxSeries) {
     return outcome.Fail("bad_request", "\"series\" must be a list of 1 to 64 series ids");
   }
   for (const Json::Value& id : series) {
-    if (!id.isString() || id.asString().empty() || id.asString().size() > kMaxSeriesId) {
-      return outcome.Fail("bad_request", "every id of \"series\" must be a non-empty text");
+    if (!id.isString() || !IsSeriesId(id.asString())) {
+      return outcome.Fail("bad_request",
+                          "every id of \"series\" must be a text of 1 to 256 bytes of UTF-8 "
+                          "without control characters");
     }
     ids.push_back(id.asString());
   }
@@ -126,7 +122,7 @@ bool Realtime(const Json::Value& request, Collector& collector, Outcome& outcome
   std::vector<std::string> ids;
   int64_t since = 0;
   if (!ReadSeries(request, ids, outcome) ||
-      !ReadWhole(request, "since", 0, 0, kLatestTime, since, outcome)) {
+      !ReadWhole(request, "since", 0, 0, kStatisticsLatestTime, since, outcome)) {
     return false;
   }
   std::vector<RealtimeSeries> found;
@@ -156,9 +152,10 @@ bool History(const Json::Value& request, Collector& collector, Outcome& outcome)
   int64_t to = 0;
   int64_t points = 0;
   if (!ReadSeries(request, ids, outcome) ||
-      !ReadWhole(request, "from", std::nullopt, 0, kLatestTime, from, outcome) ||
-      !ReadWhole(request, "to", std::nullopt, 0, kLatestTime, to, outcome) ||
-      !ReadWhole(request, "points", kDefaultPoints, 1, kMaxPoints, points, outcome)) {
+      !ReadWhole(request, "from", std::nullopt, 0, kStatisticsLatestTime, from, outcome) ||
+      !ReadWhole(request, "to", std::nullopt, 0, kStatisticsLatestTime, to, outcome) ||
+      !ReadWhole(request, "points", kStatisticsDefaultPoints, 1, kStatisticsMaxPoints, points,
+                 outcome)) {
     return false;
   }
   if (from >= to) return outcome.Fail("bad_request", "\"from\" must be before \"to\"");
@@ -213,7 +210,8 @@ bool Parse(std::string_view line, Json::Value& request) {
 }
 
 std::string AnswerOf(std::string_view line, Collector& collector) {
-  if (line.size() > kMaxRequest) return ErrorAnswer("too_large", "the request is over 64 KiB");
+  if (line.size() > kStatisticsMaxRequest)
+    return ErrorAnswer("too_large", "the request is over 64 KiB");
   Json::Value request;
   if (!Parse(line, request)) return ErrorAnswer("bad_request", "the request is not a JSON object");
   const Json::Value& name = request["request"];
@@ -232,7 +230,7 @@ std::string AnswerOf(std::string_view line, Collector& collector) {
       if (!outcome.data.isNull()) answer["data"] = std::move(outcome.data);
       text = Write(answer);
     }
-    if (text.size() > kMaxAnswer) {
+    if (text.size() > kStatisticsMaxAnswer) {
       return ErrorAnswer("too_large", "the answer would be over 16 MiB; ask for less");
     }
     return text;

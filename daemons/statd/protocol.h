@@ -9,13 +9,10 @@
 #include <string>
 #include <string_view>
 
+#include "kova/statistics.h"
 #include "statd/collector.h"
 
 namespace statd {
-
-// The longest request line and the longest answer the protocol allows.
-inline constexpr size_t kMaxRequest = size_t{64} << 10;
-inline constexpr size_t kMaxAnswer = size_t{16} << 20;
 
 // The answer to the request line `line` (without its line feed), without a
 // line feed: {"success":true[,"data":...]} or

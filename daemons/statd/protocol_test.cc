@@ -80,6 +80,9 @@ TEST_F(ProtocolTest, BadRequestsGetAClearErrorAndChangeNothing) {
       {"{\"request\":\"realtime\",\"series\":\"cpu.user\"}", "bad_request"},
       {"{\"request\":\"realtime\",\"series\":[1]}", "bad_request"},
       {"{\"request\":\"realtime\",\"series\":[\"\"]}", "bad_request"},
+      {"{\"request\":\"realtime\",\"series\":[\"a\\u0001\"]}", "bad_request"},
+      {"{\"request\":\"realtime\",\"series\":[\"\xc3\"]}", "bad_request"},
+      {"{\"request\":\"realtime\",\"series\":[\"\xed\xa0\x80\"]}", "bad_request"},
       {"{\"request\":\"realtime\",\"series\":[\"a\"],\"since\":\"1\"}", "bad_request"},
       {"{\"request\":\"realtime\",\"series\":[\"a\"],\"since\":1.5}", "bad_request"},
       {"{\"request\":\"realtime\",\"series\":[\"a\"],\"since\":-1}", "bad_request"},
@@ -165,10 +168,16 @@ TEST_F(ProtocolTest, MinutesGoToTheHistoryOnlyWhileItIsOn) {
   ASSERT_EQ(history_.added.size(), 1u);
   EXPECT_EQ(history_.added[0].samples, 2);
   EXPECT_DOUBLE_EQ(history_.added[0].avg, 2);
+  // At a stop, the minute not yet whole goes too.
+  collector_.Flush();
+  ASSERT_EQ(history_.added.size(), 2u);
+  EXPECT_EQ(history_.added[1].minute, 120);
+  EXPECT_EQ(history_.added[1].samples, 1);
   Settings("resourcemonitor_history=\"no\"\n");
   collector_.Record(180, {Value("cpu.user", 1)});
   collector_.Record(240, {Value("cpu.user", 1)});
-  EXPECT_EQ(history_.added.size(), 1u);
+  collector_.Flush();
+  EXPECT_EQ(history_.added.size(), 2u);
 }
 
 }  // namespace

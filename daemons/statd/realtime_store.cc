@@ -42,11 +42,23 @@ void RealtimeStore::Resize(size_t slots) {
   Prune();
 }
 
-void RealtimeStore::Clear() {
-  start_ = 0;
-  count_ = 0;
-  series_.clear();
-  index_.clear();
+void RealtimeStore::DropFrom(int64_t time) {
+  while (count_ > 0 && times_[Slot(count_ - 1)] >= time) {
+    const size_t slot = Slot(--count_);
+    for (Series& series : series_) series.values[slot] = kNoSample;
+  }
+  // A series' newest sample may have gone: find the one before, if any.
+  for (Series& series : series_) {
+    if (series.last <= newest()) continue;
+    series.last = 0;
+    for (size_t i = count_; i-- > 0;) {
+      if (!std::isnan(series.values[Slot(i)])) {
+        series.last = times_[Slot(i)];
+        break;
+      }
+    }
+  }
+  Prune();
 }
 
 bool RealtimeStore::Add(int64_t time, const std::vector<SeriesValue>& values) {

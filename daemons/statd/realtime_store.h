@@ -31,8 +31,8 @@ class RealtimeStore {
   // the ring leaves it. A series' labels follow its latest value.
   bool Add(int64_t time, const std::vector<SeriesValue>& values);
 
-  // Forgets every sample and series.
-  void Clear();
+  // Forgets the samples of `time` and after (the clock was set back before them).
+  void DropFrom(int64_t time);
 
   // Every series with a sample in the ring: those of the newest second in
   // their order, then the others.

@@ -83,9 +83,18 @@ TEST(RealtimeStore, CatalogFollowsTheSeriesThatHaveSamples) {
   // Labels follow the newest value.
   store.Add(4, {Value("service.cpu@x", 1, {{"display_name", "New name"}})});
   EXPECT_EQ(store.Catalog()[0].labels, (Labels{{"display_name", "New name"}}));
-  store.Clear();
-  EXPECT_TRUE(store.Catalog().empty());
-  EXPECT_EQ(store.newest(), 0);
+}
+
+TEST(RealtimeStore, AClockSetBackDropsTheSamplesItShowsAsFuture) {
+  RealtimeStore store(10);
+  for (int64_t t = 1; t <= 6; ++t) store.Add(t, {Value("a", static_cast<double>(t))});
+  store.Add(7, {Value("b", 7)});
+  store.DropFrom(4);
+  EXPECT_EQ(store.newest(), 3);
+  EXPECT_EQ(Read(store, "a"), (Samples{{1, 2, 3}, {1, 2, 3}}));
+  EXPECT_EQ(Ids(store), (std::vector<std::string>{"a"}));  // b had no sample left
+  EXPECT_TRUE(store.Add(4, {Value("a", 40)}));
+  EXPECT_EQ(Read(store, "a", 2), (Samples{{3, 4}, {3, 40}}));
 }
 
 }  // namespace

@@ -10,6 +10,7 @@
 #include <cstring>
 #include <fstream>
 #include <string>
+#include <vector>
 
 #include "test_support/test_root.h"
 
@@ -64,20 +65,39 @@ TEST_F(SocketServerTest, AnswersOneLinePerConnection) {
   EXPECT_NE(access(path_.c_str(), F_OK), 0);
 }
 
-TEST_F(SocketServerTest, ASilentClientDoesNotHoldUpTheOthers) {
+// Whether the server closed `fd` without an answer within `limit`.
+bool ClosedWithin(int fd, std::chrono::milliseconds limit) {
+  timeval timeout{0, static_cast<suseconds_t>(limit.count() * 1000)};
+  setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof(timeout));
+  char byte;
+  return recv(fd, &byte, 1, 0) == 0;
+}
+
+TEST_F(SocketServerTest, SilentClientsHoldOnlyTheirOwnShareAndOnlyUntilTheirDeadline) {
+  SocketLimits limits;
+  limits.workers = 1;
+  limits.per_user = 4;
+  limits.request_time = std::chrono::milliseconds(500);
   SocketServer server(
-      path_, [](std::string_view line) { return std::string(line); }, 2);
+      path_, [](std::string_view line) { return std::string(line); }, limits);
   std::string error;
   ASSERT_TRUE(server.Start(error)) << error;
-  const int silent = Connect(path_);
-  ASSERT_GE(silent, 0);
+  std::vector<int> silent;
+  for (int i = 0; i < 3; ++i) silent.push_back(Connect(path_));
   const auto start = std::chrono::steady_clock::now();
   EXPECT_EQ(Exchange(path_, "ping\n"), "ping\n");
-  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(1));
-  // The silent one is dropped without an answer after the request deadline.
-  char byte;
-  EXPECT_EQ(recv(silent, &byte, 1, 0), 0);
-  close(silent);
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(200));
+  // The fourth silent one takes the user's last place; the fifth is turned away.
+  silent.push_back(Connect(path_));
+  const int turned_away = Connect(path_);
+  EXPECT_TRUE(ClosedWithin(turned_away, std::chrono::milliseconds(200)));
+  close(turned_away);
+  // Past the request deadline the silent ones are closed, and places free again.
+  for (int fd : silent) {
+    EXPECT_TRUE(ClosedWithin(fd, std::chrono::milliseconds(1500)));
+    close(fd);
+  }
+  EXPECT_EQ(Exchange(path_, "pong\n"), "pong\n");
 }
 
 TEST_F(SocketServerTest, ReplacesAStaleSocketButNotALiveOne) {

@@ -18,13 +18,12 @@
 #include <string>
 
 #include "kova/error.h"
+#include "kova/statistics.h"
 #include "src/system_root.h"
 
 namespace {
 
-constexpr char kSocketPath[] = "/run/kova/statd.sock";
 constexpr auto kTimeout = std::chrono::seconds(3);
-constexpr size_t kMaxReply = size_t{16} << 20;  // the service's limit, the newline left out
 
 using Clock = std::chrono::steady_clock;
 
@@ -58,7 +57,7 @@ struct Transmitor::Impl {
 
   // Sends `line` and reads one reply line; the platform error on failure, 0 when done.
   int Exchange(const std::string& line) {
-    const std::string path = kova::RootPath(kSocketPath);
+    const std::string path = kova::RootPath(kStatisticsSocket);
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     if (path.size() >= sizeof(address.sun_path)) return KOVA_ERR_INVALID;
@@ -95,13 +94,13 @@ struct Transmitor::Impl {
     for (;;) {
       const size_t newline = received.find('\n', searched);
       if (newline != std::string::npos) {
-        if (newline > kMaxReply) return KOVA_ERR_FORMAT;
+        if (newline > kStatisticsMaxAnswer) return KOVA_ERR_FORMAT;
         received.resize(newline);
         reply = std::move(received);
         return 0;
       }
       searched = received.size();
-      if (received.size() > kMaxReply) return KOVA_ERR_FORMAT;
+      if (received.size() > kStatisticsMaxAnswer) return KOVA_ERR_FORMAT;
       if (!Wait(fd, POLLIN, deadline))
         return errno == ETIMEDOUT ? KOVA_ERR_TIMEOUT : KOVA_ERR_CONNECT;
       const ssize_t got = recv(fd, buffer, sizeof(buffer), 0);

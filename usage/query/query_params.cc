@@ -2,11 +2,12 @@
 
 #include <cstddef>
 
+#include "kova/statistics.h"
+
 namespace {
 
-// The latest time the collector takes, far beyond any clock.
-constexpr Json::Int64 kLatestTime = Json::Int64{1} << 40;
-constexpr size_t kMaxSeriesIdBytes = 256;
+constexpr Json::Int64 kLatestTime = kStatisticsLatestTime;
+constexpr Json::Int64 kMaxSeries = kStatisticsMaxSeries;
 
 // One parameter of a method. A series list counts its ids between `min` and
 // `max`; a number must lie between them and, when `above` names an earlier
@@ -25,15 +26,15 @@ constexpr ParamRule kNoParams[] = {
     {nullptr, false, false, 0, 0, 0, nullptr},
 };
 constexpr ParamRule kRealtimeParams[] = {
-    {"series", true, true, 1, 64, 0, nullptr},
+    {"series", true, true, 1, kMaxSeries, 0, nullptr},
     {"since", false, false, 0, kLatestTime, 0, nullptr},
     {nullptr, false, false, 0, 0, 0, nullptr},
 };
 constexpr ParamRule kHistoryParams[] = {
-    {"series", true, true, 1, 64, 0, nullptr},
+    {"series", true, true, 1, kMaxSeries, 0, nullptr},
     {"from", false, true, 0, kLatestTime, 0, nullptr},
-    {"to", false, true, 0, kLatestTime, 0, "from"},    // after "from"
-    {"points", false, false, 1, 10000, 600, nullptr},  // points per series
+    {"to", false, true, 0, kLatestTime, 0, "from"},  // after "from"
+    {"points", false, false, 1, kStatisticsMaxPoints, kStatisticsDefaultPoints, nullptr},
     {nullptr, false, false, 0, 0, 0, nullptr},
 };
 
@@ -50,16 +51,14 @@ constexpr MethodRow kMethods[] = {
 };
 
 // The ids of `value` as a new array, or nullopt when it is no array of
-// `rule.min` to `rule.max` ids, each a string of 1 to 256 bytes.
+// `rule.min` to `rule.max` ids, each one the collector takes (IsSeriesId).
 std::optional<Json::Value> ReadSeries(const Json::Value& value, const ParamRule& rule) {
   if (!value.isArray()) return std::nullopt;
   const auto count = static_cast<Json::Int64>(value.size());
   if (count < rule.min || count > rule.max) return std::nullopt;
   Json::Value ids(Json::arrayValue);
   for (const Json::Value& id : value) {
-    if (!id.isString()) return std::nullopt;
-    const size_t bytes = id.asString().size();
-    if (bytes == 0 || bytes > kMaxSeriesIdBytes) return std::nullopt;
+    if (!id.isString() || !IsSeriesId(id.asString())) return std::nullopt;
     ids.append(id);
   }
   return ids;

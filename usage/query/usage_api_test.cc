@@ -42,6 +42,7 @@ TEST_F(UsageApiTest, RefusesBadParametersWithoutAskingTheCollector) {
       {usage_realtime_v1, R"({"series": []})", "series"},
       {usage_realtime_v1, "{\"series\": " + Ids(65, 4) + "}", "series"},
       {usage_realtime_v1, R"({"series": [""]})", "series"},
+      {usage_realtime_v1, R"({"series": ["a\u0001"]})", "series"},
       {usage_realtime_v1, "{\"series\": " + Ids(1, 257) + "}", "series"},
       {usage_realtime_v1, "{" + series + R"(, "since": "60"})", "since"},
       {usage_realtime_v1, "{" + series + R"(, "since": 60.5})", "since"},

@@ -2,11 +2,14 @@
 #include <gtest/gtest.h>
 #include <pwd.h>
 #include <signal.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
+#include <filesystem>
 #include <fstream>
+#include <functional>
 #include <string>
 #include <thread>
 
@@ -106,6 +109,7 @@ TEST_F(ServicesTest, ServicesThatCannotStartSayWhy) {
   root_.Write("/etc/kova/services/kill.conf", "command=\"/bin/sleep 300\"\nstop_signal=KILL\n");
   root_.Write("/etc/kova/services/zero.conf", "command=\"/bin/sleep 300\"\nstop_timeout=0\n");
   root_.Write("/etc/kova/services/unit.conf", "command=\"/bin/sleep 300\"\nstop_timeout=5s\n");
+  root_.Write("/etc/kova/services/kova.conf", "command=\"/bin/sleep 300\"\nuser=\"nobody\"\n");
   const struct {
     const char* name;
     int error;
@@ -120,6 +124,7 @@ TEST_F(ServicesTest, ServicesThatCannotStartSayWhy) {
       {"kill", KOVA_ERR_FORMAT},
       {"zero", KOVA_ERR_FORMAT},
       {"unit", KOVA_ERR_FORMAT},
+      {"kova", KOVA_ERR_FORMAT},  // its runtime folder would hold the platform's records
   };
   for (const auto& c : cases) {
     EXPECT_LT(QLIBServiceStart(c.name, 0), 0) << c.name;
@@ -165,6 +170,57 @@ TEST_F(ServicesTest, RunsWithTheIdsOfItsAccount) {
   }
   EXPECT_EQ(StatusIds(Recorded().pid), expected);
   ASSERT_EQ(QLIBServiceStop("demo", 0), 0);
+}
+
+// A service run as an account gets its runtime folder, made or put right, as
+// the ids it runs with; a link or a file in its place fails the start.
+TEST_F(ServicesTest, MakesTheRuntimeFolderOfAnAccount) {
+  const bool root = geteuid() == 0;
+  const passwd* entry = root ? getpwnam("nobody") : getpwuid(geteuid());
+  ASSERT_NE(entry, nullptr);
+  const uid_t uid = root ? entry->pw_uid : geteuid();
+  const gid_t gid = root ? entry->pw_gid : getegid();
+  root_.Write("/opt/ready.sh", ": > \"$KOVA_ROOT/run/demo/ready\"; exec sleep 300\n", 0755);
+  root_.Write("/etc/kova/services/demo.conf", "command=\"/bin/sh " + root_.Path("/opt/ready.sh") +
+                                                  "\"\nuser=\"" + entry->pw_name + "\"\n");
+  const std::string folder = root_.Path("/run/demo");
+  const std::string elsewhere = root_.Path("/elsewhere");
+  const struct {
+    const char* name;
+    std::function<void()> make;  // what is at /run/demo before the start
+    int error;
+  } cases[] = {
+      {"missing", [] {}, 0},
+      {"wrong mode", [&] { mkdir(folder.c_str(), 0700) || chmod(folder.c_str(), 03777); }, 0},
+      // Only root can give it to another owner first.
+      {"wrong owner", [&] { mkdir(folder.c_str(), 0750) || chown(folder.c_str(), 0, 0); }, 0},
+      {"symbolic link", [&] { symlink(elsewhere.c_str(), folder.c_str()); }, KOVA_ERR_FORMAT},
+      {"file", [&] { root_.Write("/run/demo", ""); }, KOVA_ERR_FORMAT},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    std::filesystem::remove_all(folder);
+    mkdir(elsewhere.c_str(), 0755);
+    c.make();
+    if (c.error != 0) {
+      EXPECT_EQ(QLIBServiceStart("demo", 0), -1);
+      EXPECT_EQ(QLIBCErrGet(), c.error);
+      EXPECT_EQ(QLIBServiceIsRunning("demo"), 0);
+    } else {
+      ASSERT_EQ(QLIBServiceStart("demo", 0), 0);
+      EXPECT_TRUE(Eventually([&] { return access((folder + "/ready").c_str(), F_OK) == 0; }));
+      ASSERT_EQ(QLIBServiceStop("demo", 0), 0);
+    }
+    struct stat info;
+    ASSERT_EQ(lstat(folder.c_str(), &info), 0);
+    EXPECT_EQ(S_ISDIR(info.st_mode), c.error == 0);  // a link or a file is left as it was
+    if (c.error != 0) {
+      ASSERT_EQ(stat(elsewhere.c_str(), &info), 0);
+    }
+    EXPECT_EQ(info.st_mode & 07777, c.error != 0 ? 0755u : 0750u);
+    EXPECT_EQ(info.st_uid, c.error != 0 ? geteuid() : uid);
+    EXPECT_EQ(info.st_gid, c.error != 0 ? getegid() : gid);
+  }
 }
 
 // The stop signal goes to the main process alone; its group gets SIGKILL once

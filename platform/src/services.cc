@@ -118,14 +118,16 @@ int ErrorOf(int number) {
 int OpenRuntimeFolder(const std::string& name, int& error, std::string& why) {
   const int parent = open(RootPath(kRuntimeParent).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
   if (parent < 0) {
-    error = ErrorOf(errno);
-    why = std::string("has no parent folder: ") + strerror(errno);
+    const int failed = errno;
+    error = ErrorOf(failed);
+    why = std::string("has no parent folder: ") + strerror(failed);
     return -1;
   }
   int fd = -1;
   if (mkdirat(parent, name.c_str(), 0700) != 0 && errno != EEXIST) {
-    error = ErrorOf(errno);
-    why = std::string("can't be made: ") + strerror(errno);
+    const int failed = errno;
+    error = ErrorOf(failed);
+    why = std::string("can't be made: ") + strerror(failed);
   } else if ((fd = openat(parent, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC)) <
              0) {
     const int opened = errno;
@@ -163,9 +165,10 @@ int MakeRuntimeFolder(const std::string& name, uid_t uid, gid_t gid) {
       (fstat(fd, &info) != 0 ||
        ((info.st_uid != uid || info.st_gid != gid) && fchown(fd, uid, gid) != 0) ||
        ((info.st_mode & 07777) != kRuntimeFolderMode && fchmod(fd, kRuntimeFolderMode) != 0))) {
-    error = ErrorOf(errno);
+    const int failed = errno;
+    error = ErrorOf(failed);
     why = "can't be given to " + std::to_string(uid) + ":" + std::to_string(gid) +
-          " with mode 0750: " + strerror(errno);
+          " with mode 0750: " + strerror(failed);
   }
   if (fd >= 0) close(fd);
   if (error != 0) {

@@ -1,17 +1,19 @@
 #!/usr/bin/env bash
-# Installs the service "pgsql" into a system root: its description,
-# <root>/etc/kova/services/pgsql.conf, running PROGRAM as ACCOUNT; the folder
-# of the cluster on the volume behind the share link /var/services/pgsql (and
-# the link, to /volume1/@database/pgsql, when there is none); the socket folder
-# <root>/run/pgsql and the log <root>/var/log/kova/pgsql.log. All three belong
-# to ACCOUNT, and the script checks that ACCOUNT can reach them.
+# Installs the service "pgsql" into a system root, running PROGRAM as ACCOUNT:
+# gives ACCOUNT the folder of the cluster on the volume behind the share link
+# /var/services/pgsql (and makes the link, to /volume1/@database/pgsql, when
+# there is none) and the log <root>/var/log/kova/pgsql.log, checks as ACCOUNT
+# that the program can run there, and only then has ../install-service.sh write
+# the description <root>/etc/kova/services/pgsql.conf. The socket folder
+# <root>/run/pgsql is the service's runtime folder: the platform makes it for
+# ACCOUNT at each start.
 #
 #   install-service.sh ROOT [--user ACCOUNT] [PROGRAM]
 #
-# ACCOUNT is "postgres" (Debian's postgresql package makes it) when run as
-# root; anyone else installs the service for their own account. PROGRAM is by
-# default ROOT/usr/sbin/kova-pgsql, where `cmake --install <build> --prefix
-# ROOT/usr` puts it; the script runs it with --check as ACCOUNT.
+# ACCOUNT is "kovapgsql" (scripts/setup makes it) when run as root; anyone else
+# installs the service for their own account. PROGRAM is by default
+# ROOT/usr/sbin/kova-pgsql, where `cmake --install <build> --prefix ROOT/usr`
+# puts it; the script runs it with --check as ACCOUNT.
 set -euo pipefail
 
 usage() {
@@ -43,7 +45,10 @@ program=$(cd "$(dirname "$program")" && pwd)/$(basename "$program")
 case $program in *\"* | *[[:space:]]*) die "$program: the path can't hold blanks or quotes" ;; esac
 
 if [ "$(id -u)" -eq 0 ]; then
-  account=${account:-postgres}
+  account=${account:-kovapgsql}
+  if [ "$account" = kovapgsql ]; then
+    id -u kovapgsql >/dev/null 2>&1 || die "no account kovapgsql: run scripts/setup, which makes it"
+  fi
 else
   account=${account:-$(id -un)}
   [ "$account" = "$(id -un)" ] || die "only root can install the service for another account than $(id -un)"
@@ -68,18 +73,26 @@ own() {
 }
 
 link=$root/var/services/pgsql
-if [ ! -L "$link" ]; then
+if [ -L "$link" ]; then
+  # The link names a system path, a relative one from /var/services.
+  target=$(readlink "$link")
+  [[ $target == /* ]] || target=/var/services/$target
+else
   [ ! -e "$link" ] || die "$link is there but no symbolic link"
-  mkdir -p "$root/var/services"
-  ln -s /volume1/@database/pgsql "$link"
+  target=/volume1/@database/pgsql
 fi
-# The link names a system path, a relative one from /var/services.
-target=$(readlink "$link")
-[[ $target == /* ]] || target=/var/services/$target
 folder=$root$(realpath -ms -- "$target")
-mkdir -p "$folder" "$root/run/pgsql" "$root/var/log/kova" || die "can't make the service's folders"
+# A cluster stays with the account that made it: its files are that account's.
+if [ -e "$folder/data" ] && [ "$(stat -c %u "$folder/data")" != "$(id -u "$account")" ]; then
+  die "the cluster in $folder/data belongs to $(stat -c %U "$folder/data"): install the service for that account (--user), or move the cluster away for a new one to be made for $account"
+fi
+if [ ! -L "$link" ]; then
+  mkdir -p "$root/var/services"
+  ln -s "$target" "$link"
+fi
+# <root>/run holds the runtime folders, which the platform makes at each start.
+mkdir -p "$folder" "$root/run" "$root/var/log/kova" || die "can't make the service's folders"
 own "$folder" 0700
-own "$root/run/pgsql" 0750
 touch "$root/var/log/kova/pgsql.log" || die "can't make the log $root/var/log/kova/pgsql.log"
 own "$root/var/log/kova/pgsql.log" 0640
 
@@ -90,16 +103,5 @@ as_account test -x "$program" ||
 KOVA_ROOT=$root as_account "$program" --check ||
   die "the service can't run as $account in $root (the reason is above)"
 
-services=$root/etc/kova/services
-mkdir -p "$services"
-temporary=$(mktemp "$services/.pgsql.conf.XXXXXX")
-trap 'rm -f "$temporary"' EXIT
-while IFS= read -r line; do
-  case "$line" in
-    command=*) printf 'command="%s --log /var/log/kova/pgsql.log"\n' "$program" ;;
-    user=*) printf 'user="%s"\n' "$account" ;;
-    *) printf '%s\n' "$line" ;;
-  esac
-done <"$(dirname "$0")/pgsql.conf" >"$temporary"
-chmod 644 "$temporary"
-mv "$temporary" "$services/pgsql.conf"
+KOVA_SERVICE_PREPARED=pgsql "$(dirname "$0")/../install-service.sh" --user "$account" \
+  "$root" pgsql "$program" --log /var/log/kova/pgsql.log

@@ -4,6 +4,7 @@
 
 #include <dirent.h>
 #include <errno.h>
+#include <fcntl.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <syslog.h>
@@ -29,6 +30,8 @@ namespace {
 
 constexpr char kServicesDir[] = "/etc/kova/services/";
 constexpr char kRunDir[] = "/run/kova";
+constexpr char kRuntimeParent[] = "/run";
+constexpr mode_t kRuntimeFolderMode = 0750;
 constexpr char kPackagesDir[] = "/var/packages/";
 constexpr char kPackagePrefix[] = "pkgctl-";
 constexpr int kDefaultStopTimeout = 5;  // seconds
@@ -103,6 +106,78 @@ bool ReadStopPolicy(const ServiceDescription& description, StopPolicy& policy) {
   return true;
 }
 
+// The platform error for the errno of a failed file operation.
+int ErrorOf(int number) {
+  return number == EACCES || number == EPERM ? KOVA_ERR_PERMISSION : KOVA_ERR_IO;
+}
+
+// Opens the runtime folder of service `name`, made (mode 0700) when missing,
+// without following a link, so that changes through the descriptor reach that
+// folder alone. The descriptor, or -1 with the platform error in `error` and
+// what went wrong in `why`.
+int OpenRuntimeFolder(const std::string& name, int& error, std::string& why) {
+  const int parent = open(RootPath(kRuntimeParent).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  if (parent < 0) {
+    const int failed = errno;
+    error = ErrorOf(failed);
+    why = std::string("has no parent folder: ") + strerror(failed);
+    return -1;
+  }
+  int fd = -1;
+  if (mkdirat(parent, name.c_str(), 0700) != 0 && errno != EEXIST) {
+    const int failed = errno;
+    error = ErrorOf(failed);
+    why = std::string("can't be made: ") + strerror(failed);
+  } else if ((fd = openat(parent, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC)) <
+             0) {
+    const int opened = errno;
+    struct stat info;
+    if (fstatat(parent, name.c_str(), &info, AT_SYMLINK_NOFOLLOW) == 0 && !S_ISDIR(info.st_mode)) {
+      error = KOVA_ERR_FORMAT;
+      why = S_ISLNK(info.st_mode) ? "is a symbolic link" : "is no folder";
+    } else {
+      error = ErrorOf(opened);
+      why = std::string("can't be opened: ") + strerror(opened);
+    }
+  }
+  close(parent);
+  return fd;
+}
+
+// Makes the runtime folder of service `name`, or takes the one there, and gives
+// it to `uid`:`gid` with mode 0750. Returns 0, or the platform error, said in
+// the system log: KOVA_ERR_FORMAT when the path is a symbolic link, no folder
+// or the platform's own records; KOVA_ERR_PERMISSION or KOVA_ERR_IO when the
+// folder can't be made or changed.
+int MakeRuntimeFolder(const std::string& name, uid_t uid, gid_t gid) {
+  const std::string folder = RuntimeFolder(name);
+  int error = 0;
+  std::string why;
+  int fd = -1;
+  if (folder == kRunDir) {
+    error = KOVA_ERR_FORMAT;
+    why = "holds the platform's records";
+  } else {
+    fd = OpenRuntimeFolder(name, error, why);
+  }
+  struct stat info;
+  if (fd >= 0 &&
+      (fstat(fd, &info) != 0 ||
+       ((info.st_uid != uid || info.st_gid != gid) && fchown(fd, uid, gid) != 0) ||
+       ((info.st_mode & 07777) != kRuntimeFolderMode && fchmod(fd, kRuntimeFolderMode) != 0))) {
+    const int failed = errno;
+    error = ErrorOf(failed);
+    why = "can't be given to " + std::to_string(uid) + ":" + std::to_string(gid) +
+          " with mode 0750: " + strerror(failed);
+  }
+  if (fd >= 0) close(fd);
+  if (error != 0) {
+    syslog(LOG_DAEMON | LOG_ERR, "kova: service %s: its runtime folder %s %s", name.c_str(),
+           RootPath(folder).c_str(), why.c_str());
+  }
+  return error;
+}
+
 // Records `error` where it happened and fails with -1.
 #define FAILED(error) (KOVA_SET_ERROR(error), -1)
 
@@ -135,6 +210,15 @@ int Start(const std::string& name) {
     syslog(LOG_DAEMON | LOG_ERR, "kova: service %s: %s account \"%s\"", name.c_str(),
            unknown ? "no such" : "cannot look up the", description.user.c_str());
     return FAILED(unknown ? KOVA_ERR_NOT_FOUND : KOVA_ERR_IO);
+  }
+  if (!description.user.empty()) {
+    // The folder belongs to the ids the service takes: the account's when this
+    // process is root, this process's own otherwise.
+    const bool root = geteuid() == 0;
+    if (int error = MakeRuntimeFolder(name, root ? account.uid : geteuid(),
+                                      root ? account.gid : getegid())) {
+      return FAILED(error);
+    }
   }
   const std::vector<std::string> env = {
       "PATH=/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin", "LANG=C.UTF-8",
@@ -215,6 +299,8 @@ int DescribeService(const std::string& name, ServiceDescription& description) {
   if (description.display_name.empty()) description.display_name = name;
   return 1;
 }
+
+std::string RuntimeFolder(const std::string& name) { return kRuntimeParent + ("/" + name); }
 
 std::vector<std::string> ListServices() {
   std::vector<std::string> names;

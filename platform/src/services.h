@@ -9,7 +9,12 @@
 //   package       the package the service belongs to, if any
 //   user          the account the service runs as when the platform is root
 //                 (its uid, primary gid and groups); root when unset. A caller
-//                 that is not root starts services with its own ids.
+//                 that is not root starts services with its own ids. Each start
+//                 of such a service makes its runtime folder /run/<name>, mode
+//                 0750, owned by the ids the service runs with (the account's
+//                 uid and primary gid), before they are taken, or puts right the
+//                 owner and mode of the folder there; a symbolic link or anything
+//                 else than a folder there fails the start (KOVA_ERR_FORMAT)
 //   stop_signal   the signal that stops the service (HUP, INT, QUIT, TERM, USR1
 //                 or USR2, "SIG" in front allowed), sent to its main process
 //                 alone; unset, SIGTERM goes to the service's whole process group
@@ -41,6 +46,9 @@ struct ServiceDescription {
 // 0 when it is not (or the name can't be a service's), -1 when its file can't
 // be read; the last platform error says why on 0 and -1.
 int DescribeService(const std::string& name, ServiceDescription& description);
+
+// The runtime folder of service `name`, a system path: /run/<name>.
+std::string RuntimeFolder(const std::string& name);
 
 // The names of the described services, sorted.
 std::vector<std::string> ListServices();

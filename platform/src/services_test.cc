@@ -2,11 +2,14 @@
 #include <gtest/gtest.h>
 #include <pwd.h>
 #include <signal.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
+#include <filesystem>
 #include <fstream>
+#include <functional>
 #include <string>
 #include <thread>
 
@@ -15,6 +18,7 @@
 #include "src/service_process.h"
 #include "src/services.h"
 #include "src/system_root.h"
+#include "test_support/run_in_child.h"
 #include "test_support/test_root.h"
 
 namespace {
@@ -106,6 +110,7 @@ TEST_F(ServicesTest, ServicesThatCannotStartSayWhy) {
   root_.Write("/etc/kova/services/kill.conf", "command=\"/bin/sleep 300\"\nstop_signal=KILL\n");
   root_.Write("/etc/kova/services/zero.conf", "command=\"/bin/sleep 300\"\nstop_timeout=0\n");
   root_.Write("/etc/kova/services/unit.conf", "command=\"/bin/sleep 300\"\nstop_timeout=5s\n");
+  root_.Write("/etc/kova/services/kova.conf", "command=\"/bin/sleep 300\"\nuser=\"nobody\"\n");
   const struct {
     const char* name;
     int error;
@@ -120,6 +125,7 @@ TEST_F(ServicesTest, ServicesThatCannotStartSayWhy) {
       {"kill", KOVA_ERR_FORMAT},
       {"zero", KOVA_ERR_FORMAT},
       {"unit", KOVA_ERR_FORMAT},
+      {"kova", KOVA_ERR_FORMAT},  // its runtime folder would hold the platform's records
   };
   for (const auto& c : cases) {
     EXPECT_LT(QLIBServiceStart(c.name, 0), 0) << c.name;
@@ -141,30 +147,133 @@ std::string StatusIds(pid_t pid) {
   return out;
 }
 
-// Started by root, a service runs with its account's uid, gid and groups, as
-// the user database has them; started by anyone else, with the caller's ids.
-TEST_F(ServicesTest, RunsWithTheIdsOfItsAccount) {
+// The status lines of a process whose ids are all `uid` and `gid`, in `groups`.
+std::string StatusIdsOf(uid_t uid, gid_t gid, std::vector<gid_t> groups) {
+  std::sort(groups.begin(), groups.end());  // the kernel keeps them sorted
+  const std::string u = "\t" + std::to_string(uid);
+  const std::string g = "\t" + std::to_string(gid);
+  std::string out = "Uid:" + u + u + u + u + "\nGid:" + g + g + g + g + "\nGroups:\t";
+  for (size_t i = 0; i < groups.size(); ++i) out += (i > 0 ? " " : "") + std::to_string(groups[i]);
+  return out + " \n";
+}
+
+// A service that tries to get root back, writes whether it could and its real
+// and effective uids, and stays.
+constexpr char kRegainScript[] = R"pl(use POSIX ();
+my $got = POSIX::setuid(0) ? "regained" : "refused";
+my $file = "$ENV{KOVA_ROOT}/tmp/regain";
+open(my $out, ">", "$file.new") or die;
+print $out "$got $< $>\n";
+close($out);
+rename("$file.new", $file);
+sleep 300;
+)pl";
+
+// Started by root, or by the web-API host's runner (effective ids nobody's,
+// real and saved ids root's) raising root for the start, a service runs fully
+// as root or with its account's uid, gid and groups as the user database has
+// them, and can't get root back; started by anyone else, with the caller's ids.
+TEST_F(ServicesTest, RunsWithTheIdsOfItsAccountWhoeverStartsIt) {
   // postgres has a supplementary group on Debian; nobody is there everywhere.
-  const char* account = getpwnam("postgres") != nullptr ? "postgres" : "nobody";
-  root_.Write("/etc/kova/services/demo.conf",
-              "command=\"/bin/sleep 300\"\nuser=\"" + std::string(account) + "\"\n");
-  ASSERT_EQ(QLIBServiceStart("demo", 0), 0);
-  std::string expected = StatusIds(getpid());
-  if (geteuid() == 0) {
-    const passwd* entry = getpwnam(account);
-    gid_t groups[64];
-    int count = 64;
-    ASSERT_GE(getgrouplist(account, entry->pw_gid, groups, &count), 0);
-    std::sort(groups, groups + count);  // the kernel keeps them sorted
-    const std::string uid = "\t" + std::to_string(entry->pw_uid);
-    const std::string gid = "\t" + std::to_string(entry->pw_gid);
-    expected = "Uid:" + uid + uid + uid + uid + "\nGid:" + gid + gid + gid + gid + "\nGroups:\t";
-    for (int i = 0; i < count; ++i)
-      expected += std::to_string(groups[i]) + (i + 1 < count ? " " : "");
-    expected += " \n";
+  const char* name = getpwnam("postgres") != nullptr ? "postgres" : "nobody";
+  const passwd* entry = getpwnam(name);
+  ASSERT_NE(entry, nullptr);
+  std::vector<gid_t> groups(64);
+  int count = static_cast<int>(groups.size());
+  ASSERT_GE(getgrouplist(name, entry->pw_gid, groups.data(), &count), 0);
+  groups.resize(count);
+  const bool root = geteuid() == 0;
+  root_.Write("/opt/regain.pl", kRegainScript, 0755);
+  const struct {
+    const char* caller;
+    bool runner;  // the runner's ids, or this process's
+    const char* user;
+  } cases[] = {
+      {"this process", false, name},
+      {"this process", false, ""},
+      {"runner", true, name},
+      {"runner", true, ""},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(std::string(c.caller) + " starting a service of user \"" + c.user + "\"");
+    if (c.runner && !root) continue;  // only root can take the runner's ids
+    unlink(root_.Path("/tmp/regain").c_str());
+    root_.Write("/etc/kova/services/demo.conf", "command=\"/usr/bin/perl " +
+                                                    root_.Path("/opt/regain.pl") + "\"\nuser=\"" +
+                                                    c.user + "\"\n");
+    const bool as_account = root && *c.user != '\0';
+    const uid_t uid = as_account ? entry->pw_uid : root ? 0 : geteuid();
+    const std::string expected = !root        ? StatusIds(getpid())
+                                 : as_account ? StatusIdsOf(entry->pw_uid, entry->pw_gid, groups)
+                                              : StatusIdsOf(0, 0, {});
+    const std::string regain = std::string(root && !as_account ? "regained " : "refused ") +
+                               std::to_string(uid) + " " + std::to_string(uid) + "\n";
+    const bool passed = kova_test::RunInChild([&] {
+      if (c.runner) {
+        const gid_t nogroup = 65534;
+        ASSERT_EQ(setgroups(1, &nogroup), 0);
+        ASSERT_EQ(setresgid(0, nogroup, 0), 0);
+        ASSERT_EQ(setresuid(0, 65534, 0), 0);
+      }
+      ASSERT_EQ(QLIBServiceStart("demo", 0), 0);
+      EXPECT_EQ(StatusIds(Recorded().pid), expected);
+      ASSERT_TRUE(Eventually([&] { return !root_.Read("/tmp/regain").empty(); }));
+      EXPECT_EQ(root_.Read("/tmp/regain"), regain);
+      EXPECT_EQ(QLIBServiceStop("demo", 0), 0);
+    });
+    EXPECT_TRUE(passed);
   }
-  EXPECT_EQ(StatusIds(Recorded().pid), expected);
-  ASSERT_EQ(QLIBServiceStop("demo", 0), 0);
+}
+
+// A service run as an account gets its runtime folder, made or put right, as
+// the ids it runs with; a link or a file in its place fails the start.
+TEST_F(ServicesTest, MakesTheRuntimeFolderOfAnAccount) {
+  const bool root = geteuid() == 0;
+  const passwd* entry = root ? getpwnam("nobody") : getpwuid(geteuid());
+  ASSERT_NE(entry, nullptr);
+  const uid_t uid = root ? entry->pw_uid : geteuid();
+  const gid_t gid = root ? entry->pw_gid : getegid();
+  root_.Write("/opt/ready.sh", ": > \"$KOVA_ROOT/run/demo/ready\"; exec sleep 300\n", 0755);
+  root_.Write("/etc/kova/services/demo.conf", "command=\"/bin/sh " + root_.Path("/opt/ready.sh") +
+                                                  "\"\nuser=\"" + entry->pw_name + "\"\n");
+  const std::string folder = root_.Path("/run/demo");
+  const std::string elsewhere = root_.Path("/elsewhere");
+  const struct {
+    const char* name;
+    std::function<void()> make;  // what is at /run/demo before the start
+    int error;
+  } cases[] = {
+      {"missing", [] {}, 0},
+      {"wrong mode", [&] { mkdir(folder.c_str(), 0700) || chmod(folder.c_str(), 03777); }, 0},
+      // Only root can give it to another owner first.
+      {"wrong owner", [&] { mkdir(folder.c_str(), 0750) || chown(folder.c_str(), 0, 0); }, 0},
+      {"symbolic link", [&] { symlink(elsewhere.c_str(), folder.c_str()); }, KOVA_ERR_FORMAT},
+      {"file", [&] { root_.Write("/run/demo", ""); }, KOVA_ERR_FORMAT},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    std::filesystem::remove_all(folder);
+    mkdir(elsewhere.c_str(), 0755);
+    c.make();
+    if (c.error != 0) {
+      EXPECT_EQ(QLIBServiceStart("demo", 0), -1);
+      EXPECT_EQ(QLIBCErrGet(), c.error);
+      EXPECT_EQ(QLIBServiceIsRunning("demo"), 0);
+    } else {
+      ASSERT_EQ(QLIBServiceStart("demo", 0), 0);
+      EXPECT_TRUE(Eventually([&] { return access((folder + "/ready").c_str(), F_OK) == 0; }));
+      ASSERT_EQ(QLIBServiceStop("demo", 0), 0);
+    }
+    struct stat info;
+    ASSERT_EQ(lstat(folder.c_str(), &info), 0);
+    EXPECT_EQ(S_ISDIR(info.st_mode), c.error == 0);  // a link or a file is left as it was
+    if (c.error != 0) {
+      ASSERT_EQ(stat(elsewhere.c_str(), &info), 0);
+    }
+    EXPECT_EQ(info.st_mode & 07777, c.error != 0 ? 0755u : 0750u);
+    EXPECT_EQ(info.st_uid, c.error != 0 ? geteuid() : uid);
+    EXPECT_EQ(info.st_gid, c.error != 0 ? getegid() : gid);
+  }
 }
 
 // The stop signal goes to the main process alone; its group gets SIGKILL once

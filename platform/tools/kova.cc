@@ -3,6 +3,7 @@
 
 #include <errno.h>
 #include <pwd.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdio>
@@ -178,13 +179,27 @@ int Service(const Args& args) {
   auto action = actions.find(verb);
   if (action == actions.end()) return Usage(kServiceHelp, false);
   if (action->second() >= 0) return 0;
+  // A service run as an account fails to start for want of the account or of
+  // its runtime folder: say which.
+  const int error = QLIBCErrGet();
   kova::ServiceDescription description;
-  if (verb == "start" && QLIBCErrGet() == KOVA_ERR_NOT_FOUND &&
-      kova::DescribeService(name, description) > 0 && !description.user.empty()) {
-    fprintf(stderr, "kova: cannot start %s: its account %s does not exist\n", name,
-            description.user.c_str());
-    return kFailed;
+  if (verb == "start" && kova::DescribeService(name, description) > 0 &&
+      !description.user.empty()) {
+    const std::string folder = kova::RuntimeFolder(name);
+    struct stat info;
+    if (error == KOVA_ERR_NOT_FOUND) {
+      fprintf(stderr, "kova: cannot start %s: its account %s does not exist\n", name,
+              description.user.c_str());
+      return kFailed;
+    }
+    if (error == KOVA_ERR_FORMAT && lstat(kova::RootPath(folder).c_str(), &info) == 0 &&
+        !S_ISDIR(info.st_mode)) {
+      fprintf(stderr, "kova: cannot start %s: its runtime folder %s is %s\n", name, folder.c_str(),
+              S_ISLNK(info.st_mode) ? "a symbolic link" : "no folder");
+      return kFailed;
+    }
   }
+  KOVA_SET_ERROR(error);
   return Fail("cannot " + verb + " " + name);
 }
 

@@ -48,6 +48,9 @@ expect 1 'cannot start ghost: no such service is described' service start ghost
 printf 'command="/bin/sleep 300"\nuser="kova-no-such-account"\n' \
   >"$KOVA_ROOT/etc/kova/services/orphan.conf"
 expect 1 'cannot start orphan: its account kova-no-such-account does not exist' service start orphan
+printf 'command="/bin/sleep 300"\nuser="%s"\n' "$(id -un)" >"$KOVA_ROOT/etc/kova/services/linked.conf"
+mkdir -p "$KOVA_ROOT/run" && ln -s /tmp "$KOVA_ROOT/run/linked"
+expect 1 'cannot start linked: its runtime folder /run/linked is a symbolic link' service start linked
 expect 2 'usage: kova service' service restart sleeper
 
 expect 0 'usage: kova log' log --help

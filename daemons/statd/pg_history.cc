@@ -366,6 +366,10 @@ bool PgHistory::Query(const std::vector<std::string>& series, int64_t from, int6
     error = "The history's start must come before its end.";
     return false;
   }
+  if (from < 0 || to > kMaxHistoryTime) {
+    error = "The history's times must lie between 0 and 2^40.";
+    return false;
+  }
   const int64_t minute_days = minute_days_;
   const QueryPlan plan = PlanQuery(from, to, points, Now() - minute_days * kSecondsPerDay);
   answer.step = plan.step;
@@ -379,9 +383,8 @@ bool PgHistory::Query(const std::vector<std::string>& series, int64_t from, int6
 
   std::lock_guard<std::mutex> lock(query_mutex_);
   const Deadline deadline = steady_clock::now() + kQueryTimeout;
-  const std::vector<std::string> params = {TextArray(series), std::to_string(from),
-                                           std::to_string(to), std::to_string(plan.step),
-                                           std::to_string(points)};
+  const std::vector<std::string> params = {TextArray(series), std::to_string(plan.origin),
+                                           std::to_string(to), std::to_string(plan.step)};
   PgError failure;
   PgResult rows;
   bool ok = false;
@@ -414,7 +417,7 @@ bool PgHistory::Query(const std::vector<std::string>& series, int64_t from, int6
   for (int row = 0; row < PQntuples(rows.get()); ++row) {
     const auto found = places.find(PQgetvalue(rows.get(), row, 0));
     if (found == places.end()) continue;
-    const int64_t time = from + Field<int64_t>(rows.get(), row, 1) * plan.step;
+    const int64_t time = plan.origin + Field<int64_t>(rows.get(), row, 1) * plan.step;
     for (size_t place : found->second) {
       HistorySeries& out = answer.series[place];
       out.times.push_back(time);

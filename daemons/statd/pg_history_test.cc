@@ -241,13 +241,15 @@ TEST_F(PgHistoryTest, ASpoolOutlivesTheHistoryAndNeverDoublesRows) {
 }
 
 TEST_F(PgHistoryTest, ReducesEachSeriesOnTheServer) {
-  // Series "a" over three hours and a minute: even minutes 30 samples of
+  // Series "a" over three hours and 21 minutes: even minutes 30 samples of
   // 100 * hour, odd minutes 10 samples of 100 * hour + 40, each within +-5.
-  // Series "b" only in the third hour and the minute after, 60 samples of 7.
+  // Series "b" from the third hour on, 60 samples of 7. Hours 0 to 2 are
+  // rolled up (hour 2: 1200 samples of 210); hour 3 isn't (430 samples of
+  // 133000 / 430, from 295 to 345).
   const int64_t start = kDay0 + 6 * kHour;
   now_ = kDay0 + 2 * kDay;
   std::vector<MinuteRow> rows;
-  for (int i = 0; i <= 180; ++i) {
+  for (int i = 0; i <= 200; ++i) {
     const double avg = 100 * (i / 60) + (i % 2 ? 40 : 0);
     rows.push_back({"a", start + 60 * i, i % 2 ? 10 : 30, avg, avg - 5, avg + 5});
     if (i >= 120) rows.push_back({"b", start + 60 * i, 60, 7, 7, 7});
@@ -282,16 +284,27 @@ TEST_F(PgHistoryTest, ReducesEachSeriesOnTheServer) {
        {start, 10, -5, 45},
        {start + 3480, 10, -5, 45},
        0},
-      {"a row at `to` joins the last point",
+      {"a row at `to` takes a point more: two minutes a point",
        31,
        start,
        start + 3600,
        60,
-       60,
+       120,
        "minute",
-       60,
-       {start, 0, -5, 5},
-       {start + 3540, 85, 35, 105},
+       31,
+       {start, 10, -5, 45},
+       {start + 3600, 100, 95, 105},
+       0},
+      {"an unaligned start keeps its whole first point",
+       31,
+       start + 90,
+       start + 3689,
+       30,
+       180,
+       "minute",
+       21,
+       {start, 400.0 / 70, -5, 45},
+       {start + 3600, 110, 95, 145},
        0},
       {"an hour a point",
        31,
@@ -304,9 +317,9 @@ TEST_F(PgHistoryTest, ReducesEachSeriesOnTheServer) {
        {start, 10, -5, 45},
        {start + 2 * kHour, 210, 195, 245},
        1},
-      {"hours rounded up",
+      {"from 06:30 two hours a point from 06:00",
        31,
-       start,
+       start + 1800,
        start + 3 * kHour - 1,
        2,
        2 * kHour,
@@ -314,6 +327,28 @@ TEST_F(PgHistoryTest, ReducesEachSeriesOnTheServer) {
        2,
        {start, 60, -5, 145},
        {start + 2 * kHour, 210, 195, 245},
+       1},
+      {"the hour not rolled up comes from minute rows",
+       31,
+       start,
+       start + 4 * kHour - 1,
+       4,
+       kHour,
+       "hour",
+       4,
+       {start, 10, -5, 45},
+       {start + 3 * kHour, 133000.0 / 430, 295, 345},
+       2},
+      {"a point of an hour row and minute rows",
+       31,
+       start,
+       start + 4 * kHour - 1,
+       2,
+       2 * kHour,
+       "hour",
+       2,
+       {start, 60, -5, 145},
+       {start + 2 * kHour, (252000.0 + 133000) / 1630, 195, 345},
        1},
       {"older than the minute rows",
        1,
@@ -361,6 +396,8 @@ TEST_F(PgHistoryTest, ReducesEachSeriesOnTheServer) {
   EXPECT_EQ(error, "The history's start must come before its end.");
   EXPECT_FALSE(history->Query({"a"}, start, start + 60, 0, answer, error));
   EXPECT_EQ(error, "The number of points must be at least 1.");
+  EXPECT_FALSE(history->Query({"a"}, -60, start, 10, answer, error));
+  EXPECT_EQ(error, "The history's times must lie between 0 and 2^40.");
 }
 
 TEST_F(PgHistoryTest, AHungServerHoldsNeitherQueriesNorTheStop) {

@@ -1,6 +1,7 @@
 #include "statd/pg_history.h"
 
 #include <sys/eventfd.h>
+#include <sys/random.h>
 #include <syslog.h>
 #include <time.h>
 #include <unistd.h>
@@ -30,6 +31,20 @@ constexpr char kQueryCanceled[] = "57014";
 constexpr char kUndefinedTable[] = "42P01";
 constexpr int64_t kPrunePeriod = 300;  // seconds between two prunings
 constexpr std::chrono::seconds kIdleWake{60};
+
+// A number for this run's spool batches: 63 random bits, never 0 (an older
+// version's batches).
+int64_t NewRunId() {
+  uint64_t bits = 0;
+  if (getrandom(&bits, sizeof(bits), GRND_NONBLOCK) != sizeof(bits)) {
+    // No entropy yet (early boot): the clock and the process id still differ
+    // from run to run.
+    bits = static_cast<uint64_t>(std::chrono::system_clock::now().time_since_epoch().count()) ^
+           (static_cast<uint64_t>(getpid()) << 40);
+  }
+  bits &= INT64_MAX;
+  return bits == 0 ? 1 : static_cast<int64_t>(bits);
+}
 
 // Why `row` can't be stored; empty when it can.
 const char* RowProblem(const MinuteRow& row) {
@@ -77,7 +92,8 @@ PgHistory::PgHistory(std::string conninfo, std::string spool_dir, uint64_t spool
       log_(std::move(log)),
       tuning_(std::move(tuning)),
       stop_fd_(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)),
-      spool_(std::move(spool_dir), spool_bytes, log_),
+      run_(NewRunId()),
+      spool_(std::move(spool_dir), spool_bytes, run_, log_),
       writer_(stop_fd_),
       reader_(stop_fd_) {
   spool_.Restore();
@@ -223,7 +239,7 @@ bool PgHistory::Pass(PgError& error) {
     const bool written = WriteBatch(*batch, error);
     {
       std::lock_guard<std::mutex> lock(mutex_);
-      spool_.Done(batch->minute, written);
+      spool_.Done(batch->id, written);
     }
     if (!written) return false;
   }
@@ -244,22 +260,25 @@ bool PgHistory::Connect(PgError& error) {
 }
 
 bool PgHistory::WriteBatch(const SpoolBatch& batch, PgError& error) {
-  if (!EnsurePartitions(batch.minute, error) || !EnsureSeries(batch.rows, error)) return false;
+  const int64_t minute = batch.id.minute;
+  if (!EnsurePartitions(minute, error) || !EnsureSeries(batch.rows, error)) return false;
   std::string data;
   for (const MinuteRow& row : batch.rows) AppendCopyLine(data, series_ids_[row.series], row);
   const Deadline deadline = WriterDeadline();
-  const std::string minute = std::to_string(batch.minute);
   PgResult marked;
   if (!writer_.Run("BEGIN", {}, deadline, error) ||
-      !writer_.Run(kMarkWrittenSql, {minute}, deadline, marked, error)) {
+      !writer_.Run(
+          kMarkWrittenSql,
+          {std::to_string(minute), std::to_string(batch.id.run), std::to_string(batch.id.seq)},
+          deadline, marked, error)) {
     return false;
   }
   if (strcmp(PQcmdTuples(marked.get()), "0") == 0) {
-    log_(LOG_INFO, "the history rows of " + UtcTimestamp(batch.minute) +
+    log_(LOG_INFO, "history rows of " + UtcTimestamp(minute) +
                        " were in the database already; the spool's copy is dropped");
     return writer_.Run("ROLLBACK", {}, deadline, error);
   }
-  const int64_t hour = batch.minute - batch.minute % kSecondsPerHour;
+  const int64_t hour = minute - minute % kSecondsPerHour;
   PgResult hours;
   if (!writer_.CopyIn(kCopyMinuteRowsSql, data, deadline, error) ||
       !writer_.Run(kMarkHourSql, {std::to_string(hour)}, deadline, error) ||
@@ -340,9 +359,9 @@ bool PgHistory::Prune(PgError& error) {
       partitions_.erase(name);
     }
   }
-  // The record of written minutes goes with the days dropped, not before.
+  // The record of written batches goes with the days dropped, not before.
   const int64_t first_day = minute_start - (minute_start % kSecondsPerDay);
-  ok = ok && writer_.Run(kForgetMinutesSql, {std::to_string(first_day)}, deadline, failure);
+  ok = ok && writer_.Run(kForgetBatchesSql, {std::to_string(first_day)}, deadline, failure);
   last_prune_ = now;
   if (!writer_.is_open()) {
     error = failure;

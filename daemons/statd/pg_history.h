@@ -1,13 +1,14 @@
 // kovastatd's history in PostgreSQL (the tables in pg_schema.h).
 //
 // Add puts each minute's rows in the spool and returns; a writer thread of its
-// own writes the spooled minutes, oldest first, each with one COPY in one
+// own writes the spooled batches, oldest first, each with one COPY in one
 // transaction with its record of having been written, then removes them from
-// the spool. Hours are rolled up in SQL once a later minute is in, old day
-// partitions dropped every few minutes. While the database can't be reached
-// the minutes wait in the spool, and the writer tries again with a growing
-// pause; the change either way is said once in the system log. Queries use a
-// connection of their own.
+// the spool. Batches are named by minute and run (a number drawn at the
+// start), so that the rest of a minute a restart cut in two is written too,
+// while a batch replayed after a crash is not written twice. Hours are rolled up in SQL once a
+// later minute is in, old day partitions dropped every few minutes. While the database can't be
+// reached the minutes wait in the spool, and the writer tries again with a growing pause; the
+// change either way is said once in the system log. Queries use a connection of their own.
 
 #ifndef KOVA_DAEMONS_STATD_PG_HISTORY_H_
 #define KOVA_DAEMONS_STATD_PG_HISTORY_H_
@@ -42,8 +43,8 @@ struct PgHistoryTuning {
 class PgHistory : public HistorySink {
  public:
   // `conninfo`: libpq's connection string. `spool_dir`: the real path of the
-  // spool directory, made when missing; the minutes it holds from an earlier
-  // run are written first. `spool_bytes`: the spool's bound. `log`: the
+  // spool directory, made when missing; the batches it holds from earlier
+  // runs are written first. `spool_bytes`: the spool's bound. `log`: the
   // system log, called from any of PgHistory's threads. Starts the writer.
   PgHistory(std::string conninfo, std::string spool_dir, uint64_t spool_bytes, SystemLog log,
             PgHistoryTuning tuning = {});
@@ -55,7 +56,7 @@ class PgHistory : public HistorySink {
 
   // Takes the settings; days below 1 are refused (said) for the defaults.
   void Configure(const HistorySettings& settings) override;
-  // Spools the rows, one minute per spool file; rows that can't be stored
+  // Spools the rows, one batch per minute; rows that can't be stored
   // (an empty or control-character series name, a time not on a minute, no
   // samples, a value that isn't finite) are left out and said.
   void Add(std::vector<MinuteRow> rows) override;
@@ -73,7 +74,7 @@ class PgHistory : public HistorySink {
   // with `error` when the database failed; the connection is then closed.
   bool Pass(PgError& error);
   bool Connect(PgError& error);
-  // Writes one minute in one transaction; a minute already written is skipped.
+  // Writes one batch in one transaction; a batch already written is skipped.
   bool WriteBatch(const SpoolBatch& batch, PgError& error);
   // Makes the day partitions of the day holding `time` when they're not known.
   bool EnsurePartitions(int64_t time, PgError& error);
@@ -92,6 +93,7 @@ class PgHistory : public HistorySink {
   const SystemLog log_;
   const PgHistoryTuning tuning_;
   const int stop_fd_;  // an eventfd, readable once stopping
+  const int64_t run_;  // names this run's spool batches
 
   std::mutex mutex_;  // guards what follows up to the writer's own
   std::condition_variable wake_;

@@ -31,6 +31,7 @@ constexpr char kQueryCanceled[] = "57014";
 constexpr char kUndefinedTable[] = "42P01";
 constexpr int64_t kPrunePeriod = 300;  // seconds between two prunings
 constexpr std::chrono::seconds kIdleWake{60};
+constexpr int64_t kSeriesIdle = 86400;  // seconds unused before a series' id is forgotten
 
 // A number for this run's spool batches: 63 random bits, never 0 (an older
 // version's batches).
@@ -58,11 +59,6 @@ const char* RowProblem(const MinuteRow& row) {
     return "a row's value isn't a finite number";
   }
   return "";
-}
-
-void AppendNumber(std::string& text, double value) {
-  char buffer[32];
-  text.append(buffer, std::to_chars(buffer, buffer + sizeof(buffer), value).ptr);
 }
 
 // `row` as a line of COPY's text format.
@@ -225,6 +221,13 @@ bool PgHistory::Pass(PgError& error) {
     prune_due_ = false;
   }
   if (prune && !Prune(error)) return false;
+  if (prune) {
+    // Series gone for a day (a removed interface, an ended service) leave the
+    // cache; their rows in `series` stay, a name and a number each, and give
+    // the same id back if they return.
+    std::erase_if(series_ids_,
+                  [&](const auto& known) { return now - known.second.used >= kSeriesIdle; });
+  }
   for (;;) {
     std::optional<SpoolBatch> batch;
     {
@@ -263,7 +266,12 @@ bool PgHistory::WriteBatch(const SpoolBatch& batch, PgError& error) {
   const int64_t minute = batch.id.minute;
   if (!EnsurePartitions(minute, error) || !EnsureSeries(batch.rows, error)) return false;
   std::string data;
-  for (const MinuteRow& row : batch.rows) AppendCopyLine(data, series_ids_[row.series], row);
+  const int64_t now = Now();
+  for (const MinuteRow& row : batch.rows) {
+    KnownSeries& known = series_ids_[row.series];
+    known.used = now;
+    AppendCopyLine(data, known.id, row);
+  }
   const Deadline deadline = WriterDeadline();
   PgResult marked;
   if (!writer_.Run("BEGIN", {}, deadline, error) ||
@@ -323,7 +331,7 @@ bool PgHistory::EnsureSeries(const std::vector<MinuteRow>& rows, PgError& error)
     return false;
   }
   for (int row = 0; row < PQntuples(ids.get()); ++row) {
-    series_ids_[PQgetvalue(ids.get(), row, 1)] = Field<int64_t>(ids.get(), row, 0);
+    series_ids_[PQgetvalue(ids.get(), row, 1)] = {Field<int64_t>(ids.get(), row, 0), Now()};
   }
   for (const std::string& name : missing) {
     if (series_ids_.count(name) == 0) {

@@ -114,8 +114,12 @@ class PgHistory : public HistorySink {
   bool said_waiting_ = false;
   bool said_prune_failed_ = false;
   int64_t last_prune_ = 0;
-  std::map<std::string, int64_t> series_ids_;
-  std::set<std::string> partitions_;  // known to exist since the connect
+  struct KnownSeries {
+    int64_t id = 0;
+    int64_t used = 0;  // Now() when a batch last held it
+  };
+  std::map<std::string, KnownSeries> series_ids_;  // bounded: unused a day, forgotten
+  std::set<std::string> partitions_;               // known to exist since the connect
   std::thread thread_;
 
   std::mutex query_mutex_;  // one query at a time

@@ -33,11 +33,13 @@ namespace statd {
 
 constexpr uint64_t kDefaultSpoolBytes = 64 << 20;
 
-// What tests change: the clock and how long the writer pauses at most before
-// trying the database again.
+// What tests and benchmarks change: the clock, how long the writer pauses at
+// most before trying the database again, and how long the server may take
+// for a query.
 struct PgHistoryTuning {
   std::function<int64_t()> now;  // Unix seconds; the system clock when empty
   std::chrono::milliseconds retry_max{4000};
+  std::chrono::milliseconds query_timeout{2000};
 };
 
 class PgHistory : public HistorySink {

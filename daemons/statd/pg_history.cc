@@ -1,6 +1,7 @@
 #include "statd/pg_history.h"
 
 #include <sys/eventfd.h>
+#include <sys/random.h>
 #include <syslog.h>
 #include <time.h>
 #include <unistd.h>
@@ -22,14 +23,29 @@ using std::chrono::steady_clock;
 
 constexpr milliseconds kRetryMin{250};
 constexpr std::chrono::seconds kWriterTimeout{30};
-// The client's whole exchange has 3 s; the server ends a statement after 2 s.
-constexpr milliseconds kQueryTimeout{2500};
-constexpr char kReaderSessionSql[] = "SET statement_timeout = 2000";
+// The client's whole exchange has 3 s; the server ends a statement after the
+// tuning's query_timeout (2 s), the reader gives up this much later.
+constexpr milliseconds kQueryGrace{500};
 constexpr char kWriterSessionSql[] = "SET lock_timeout = 5000";
 constexpr char kQueryCanceled[] = "57014";
 constexpr char kUndefinedTable[] = "42P01";
 constexpr int64_t kPrunePeriod = 300;  // seconds between two prunings
 constexpr std::chrono::seconds kIdleWake{60};
+constexpr int64_t kSeriesIdle = 86400;  // seconds unused before a series' id is forgotten
+
+// A number for this run's spool batches: 63 random bits, never 0 (an older
+// version's batches).
+int64_t NewRunId() {
+  uint64_t bits = 0;
+  if (getrandom(&bits, sizeof(bits), GRND_NONBLOCK) != sizeof(bits)) {
+    // No entropy yet (early boot): the clock and the process id still differ
+    // from run to run.
+    bits = static_cast<uint64_t>(std::chrono::system_clock::now().time_since_epoch().count()) ^
+           (static_cast<uint64_t>(getpid()) << 40);
+  }
+  bits &= INT64_MAX;
+  return bits == 0 ? 1 : static_cast<int64_t>(bits);
+}
 
 // Why `row` can't be stored; empty when it can.
 const char* RowProblem(const MinuteRow& row) {
@@ -43,11 +59,6 @@ const char* RowProblem(const MinuteRow& row) {
     return "a row's value isn't a finite number";
   }
   return "";
-}
-
-void AppendNumber(std::string& text, double value) {
-  char buffer[32];
-  text.append(buffer, std::to_chars(buffer, buffer + sizeof(buffer), value).ptr);
 }
 
 // `row` as a line of COPY's text format.
@@ -77,7 +88,8 @@ PgHistory::PgHistory(std::string conninfo, std::string spool_dir, uint64_t spool
       log_(std::move(log)),
       tuning_(std::move(tuning)),
       stop_fd_(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)),
-      spool_(std::move(spool_dir), spool_bytes, log_),
+      run_(NewRunId()),
+      spool_(std::move(spool_dir), spool_bytes, run_, log_),
       writer_(stop_fd_),
       reader_(stop_fd_) {
   spool_.Restore();
@@ -209,6 +221,13 @@ bool PgHistory::Pass(PgError& error) {
     prune_due_ = false;
   }
   if (prune && !Prune(error)) return false;
+  if (prune) {
+    // Series gone for a day (a removed interface, an ended service) leave the
+    // cache; their rows in `series` stay, a name and a number each, and give
+    // the same id back if they return.
+    std::erase_if(series_ids_,
+                  [&](const auto& known) { return now - known.second.used >= kSeriesIdle; });
+  }
   for (;;) {
     std::optional<SpoolBatch> batch;
     {
@@ -223,7 +242,7 @@ bool PgHistory::Pass(PgError& error) {
     const bool written = WriteBatch(*batch, error);
     {
       std::lock_guard<std::mutex> lock(mutex_);
-      spool_.Done(batch->minute, written);
+      spool_.Done(batch->id, written);
     }
     if (!written) return false;
   }
@@ -244,22 +263,30 @@ bool PgHistory::Connect(PgError& error) {
 }
 
 bool PgHistory::WriteBatch(const SpoolBatch& batch, PgError& error) {
-  if (!EnsurePartitions(batch.minute, error) || !EnsureSeries(batch.rows, error)) return false;
+  const int64_t minute = batch.id.minute;
+  if (!EnsurePartitions(minute, error) || !EnsureSeries(batch.rows, error)) return false;
   std::string data;
-  for (const MinuteRow& row : batch.rows) AppendCopyLine(data, series_ids_[row.series], row);
+  const int64_t now = Now();
+  for (const MinuteRow& row : batch.rows) {
+    KnownSeries& known = series_ids_[row.series];
+    known.used = now;
+    AppendCopyLine(data, known.id, row);
+  }
   const Deadline deadline = WriterDeadline();
-  const std::string minute = std::to_string(batch.minute);
   PgResult marked;
   if (!writer_.Run("BEGIN", {}, deadline, error) ||
-      !writer_.Run(kMarkWrittenSql, {minute}, deadline, marked, error)) {
+      !writer_.Run(
+          kMarkWrittenSql,
+          {std::to_string(minute), std::to_string(batch.id.run), std::to_string(batch.id.seq)},
+          deadline, marked, error)) {
     return false;
   }
   if (strcmp(PQcmdTuples(marked.get()), "0") == 0) {
-    log_(LOG_INFO, "the history rows of " + UtcTimestamp(batch.minute) +
+    log_(LOG_INFO, "history rows of " + UtcTimestamp(minute) +
                        " were in the database already; the spool's copy is dropped");
     return writer_.Run("ROLLBACK", {}, deadline, error);
   }
-  const int64_t hour = batch.minute - batch.minute % kSecondsPerHour;
+  const int64_t hour = minute - minute % kSecondsPerHour;
   PgResult hours;
   if (!writer_.CopyIn(kCopyMinuteRowsSql, data, deadline, error) ||
       !writer_.Run(kMarkHourSql, {std::to_string(hour)}, deadline, error) ||
@@ -304,7 +331,7 @@ bool PgHistory::EnsureSeries(const std::vector<MinuteRow>& rows, PgError& error)
     return false;
   }
   for (int row = 0; row < PQntuples(ids.get()); ++row) {
-    series_ids_[PQgetvalue(ids.get(), row, 1)] = Field<int64_t>(ids.get(), row, 0);
+    series_ids_[PQgetvalue(ids.get(), row, 1)] = {Field<int64_t>(ids.get(), row, 0), Now()};
   }
   for (const std::string& name : missing) {
     if (series_ids_.count(name) == 0) {
@@ -340,9 +367,9 @@ bool PgHistory::Prune(PgError& error) {
       partitions_.erase(name);
     }
   }
-  // The record of written minutes goes with the days dropped, not before.
+  // The record of written batches goes with the days dropped, not before.
   const int64_t first_day = minute_start - (minute_start % kSecondsPerDay);
-  ok = ok && writer_.Run(kForgetMinutesSql, {std::to_string(first_day)}, deadline, failure);
+  ok = ok && writer_.Run(kForgetBatchesSql, {std::to_string(first_day)}, deadline, failure);
   last_prune_ = now;
   if (!writer_.is_open()) {
     error = failure;
@@ -366,6 +393,10 @@ bool PgHistory::Query(const std::vector<std::string>& series, int64_t from, int6
     error = "The history's start must come before its end.";
     return false;
   }
+  if (from < 0 || to > kMaxHistoryTime) {
+    error = "The history's times must lie between 0 and 2^40.";
+    return false;
+  }
   const int64_t minute_days = minute_days_;
   const QueryPlan plan = PlanQuery(from, to, points, Now() - minute_days * kSecondsPerDay);
   answer.step = plan.step;
@@ -378,10 +409,13 @@ bool PgHistory::Query(const std::vector<std::string>& series, int64_t from, int6
   if (series.empty()) return true;
 
   std::lock_guard<std::mutex> lock(query_mutex_);
-  const Deadline deadline = steady_clock::now() + kQueryTimeout;
-  const std::vector<std::string> params = {TextArray(series), std::to_string(from),
-                                           std::to_string(to), std::to_string(plan.step),
-                                           std::to_string(points)};
+  const Deadline deadline = steady_clock::now() + tuning_.query_timeout + kQueryGrace;
+  // Statements this short gain nothing from JIT compiling; it costs milliseconds.
+  const std::string session_sql =
+      "SET statement_timeout = " + std::to_string(tuning_.query_timeout.count()) +
+      "; SET jit = off";
+  const std::vector<std::string> params = {TextArray(series), std::to_string(plan.origin),
+                                           std::to_string(to), std::to_string(plan.step)};
   PgError failure;
   PgResult rows;
   bool ok = false;
@@ -390,7 +424,7 @@ bool PgHistory::Query(const std::vector<std::string>& series, int64_t from, int6
     const bool was_open = reader_.is_open();
     if (!was_open && (!reader_.Open(conninfo_, deadline, failure) ||
                       !reader_.Run(kSessionSql, {}, deadline, failure) ||
-                      !reader_.Run(kReaderSessionSql, {}, deadline, failure))) {
+                      !reader_.Run(session_sql, {}, deadline, failure))) {
       reader_.Close();
       break;
     }
@@ -403,7 +437,10 @@ bool PgHistory::Query(const std::vector<std::string>& series, int64_t from, int6
   if (!ok) {
     if (failure.sqlstate == kUndefinedTable) return true;  // nothing was ever written
     if (failure.sqlstate == kQueryCanceled) {
-      error = "The history query took longer than 2 seconds.";
+      const int64_t ms = tuning_.query_timeout.count();
+      error =
+          "The history query took longer than " +
+          (ms % 1000 == 0 ? std::to_string(ms / 1000) + " seconds." : std::to_string(ms) + " ms.");
     } else if (!reader_.is_open()) {
       error = "The history database can't be reached: " + failure.message + ".";
     } else {
@@ -414,7 +451,7 @@ bool PgHistory::Query(const std::vector<std::string>& series, int64_t from, int6
   for (int row = 0; row < PQntuples(rows.get()); ++row) {
     const auto found = places.find(PQgetvalue(rows.get(), row, 0));
     if (found == places.end()) continue;
-    const int64_t time = from + Field<int64_t>(rows.get(), row, 1) * plan.step;
+    const int64_t time = plan.origin + Field<int64_t>(rows.get(), row, 1) * plan.step;
     for (size_t place : found->second) {
       HistorySeries& out = answer.series[place];
       out.times.push_back(time);

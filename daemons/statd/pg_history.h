@@ -1,13 +1,14 @@
 // kovastatd's history in PostgreSQL (the tables in pg_schema.h).
 //
 // Add puts each minute's rows in the spool and returns; a writer thread of its
-// own writes the spooled minutes, oldest first, each with one COPY in one
+// own writes the spooled batches, oldest first, each with one COPY in one
 // transaction with its record of having been written, then removes them from
-// the spool. Hours are rolled up in SQL once a later minute is in, old day
-// partitions dropped every few minutes. While the database can't be reached
-// the minutes wait in the spool, and the writer tries again with a growing
-// pause; the change either way is said once in the system log. Queries use a
-// connection of their own.
+// the spool. Batches are named by minute and run (a number drawn at the
+// start), so that the rest of a minute a restart cut in two is written too,
+// while a batch replayed after a crash is not written twice. Hours are rolled up in SQL once a
+// later minute is in, old day partitions dropped every few minutes. While the database can't be
+// reached the minutes wait in the spool, and the writer tries again with a growing pause; the
+// change either way is said once in the system log. Queries use a connection of their own.
 
 #ifndef KOVA_DAEMONS_STATD_PG_HISTORY_H_
 #define KOVA_DAEMONS_STATD_PG_HISTORY_H_
@@ -32,18 +33,20 @@ namespace statd {
 
 constexpr uint64_t kDefaultSpoolBytes = 64 << 20;
 
-// What tests change: the clock and how long the writer pauses at most before
-// trying the database again.
+// What tests and benchmarks change: the clock, how long the writer pauses at
+// most before trying the database again, and how long the server may take
+// for a query.
 struct PgHistoryTuning {
   std::function<int64_t()> now;  // Unix seconds; the system clock when empty
   std::chrono::milliseconds retry_max{4000};
+  std::chrono::milliseconds query_timeout{2000};
 };
 
 class PgHistory : public HistorySink {
  public:
   // `conninfo`: libpq's connection string. `spool_dir`: the real path of the
-  // spool directory, made when missing; the minutes it holds from an earlier
-  // run are written first. `spool_bytes`: the spool's bound. `log`: the
+  // spool directory, made when missing; the batches it holds from earlier
+  // runs are written first. `spool_bytes`: the spool's bound. `log`: the
   // system log, called from any of PgHistory's threads. Starts the writer.
   PgHistory(std::string conninfo, std::string spool_dir, uint64_t spool_bytes, SystemLog log,
             PgHistoryTuning tuning = {});
@@ -55,7 +58,7 @@ class PgHistory : public HistorySink {
 
   // Takes the settings; days below 1 are refused (said) for the defaults.
   void Configure(const HistorySettings& settings) override;
-  // Spools the rows, one minute per spool file; rows that can't be stored
+  // Spools the rows, one batch per minute; rows that can't be stored
   // (an empty or control-character series name, a time not on a minute, no
   // samples, a value that isn't finite) are left out and said.
   void Add(std::vector<MinuteRow> rows) override;
@@ -73,7 +76,7 @@ class PgHistory : public HistorySink {
   // with `error` when the database failed; the connection is then closed.
   bool Pass(PgError& error);
   bool Connect(PgError& error);
-  // Writes one minute in one transaction; a minute already written is skipped.
+  // Writes one batch in one transaction; a batch already written is skipped.
   bool WriteBatch(const SpoolBatch& batch, PgError& error);
   // Makes the day partitions of the day holding `time` when they're not known.
   bool EnsurePartitions(int64_t time, PgError& error);
@@ -92,6 +95,7 @@ class PgHistory : public HistorySink {
   const SystemLog log_;
   const PgHistoryTuning tuning_;
   const int stop_fd_;  // an eventfd, readable once stopping
+  const int64_t run_;  // names this run's spool batches
 
   std::mutex mutex_;  // guards what follows up to the writer's own
   std::condition_variable wake_;
@@ -112,8 +116,12 @@ class PgHistory : public HistorySink {
   bool said_waiting_ = false;
   bool said_prune_failed_ = false;
   int64_t last_prune_ = 0;
-  std::map<std::string, int64_t> series_ids_;
-  std::set<std::string> partitions_;  // known to exist since the connect
+  struct KnownSeries {
+    int64_t id = 0;
+    int64_t used = 0;  // Now() when a batch last held it
+  };
+  std::map<std::string, KnownSeries> series_ids_;  // bounded: unused a day, forgotten
+  std::set<std::string> partitions_;               // known to exist since the connect
   std::thread thread_;
 
   std::mutex query_mutex_;  // one query at a time

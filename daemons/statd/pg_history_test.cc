@@ -31,7 +31,7 @@ constexpr char kSpool[] = "/var/lib/kova/statd/spool";
 
 constexpr char kMinuteRowsSql[] =
     "SELECT s.name, extract(epoch FROM r.time)::bigint, r.samples, r.avg, r.min, r.max "
-    "FROM minute_rows r JOIN series s ON s.id = r.series_id ORDER BY 2, 1";
+    "FROM minute_rows r JOIN series s ON s.id = r.series_id ORDER BY 2, 1, 3";
 constexpr char kHourRowsSql[] =
     "SELECT s.name, extract(epoch FROM r.time)::bigint, r.samples, r.avg, r.min, r.max "
     "FROM hour_rows r JOIN series s ON s.id = r.series_id ORDER BY 2, 1";
@@ -144,15 +144,13 @@ TEST_F(PgHistoryTest, RollsUpCompleteHoursOnceEach) {
   EXPECT_THAT(Rows(kHourRowsSql),
               ElementsAre("a 1700024400 90 20 1 50", "b 1700024400 1 -4 -4 -4"));
 
-  // A late minute rolls its hour again; a minute written already is skipped.
+  // A late minute rolls its hour again.
   history->Add({{"a", hour + 120, 10, 110, 0, 100}});
-  history->Add({{"a", hour + 60, 30, 40, 1, 50}});
   ASSERT_TRUE(history->WaitWritten(kWait));
   EXPECT_THAT(Rows(kHourRowsSql),
               ElementsAre("a 1700024400 100 29 0 100", "b 1700024400 1 -4 -4 -4"));
   EXPECT_EQ(Rows(kMinuteRowsSql).size(), 5u);
-  EXPECT_THAT(Log(), ElementsAre(HasSubstr("rows of 2023-11-15 05:01:00+00 were in the database "
-                                           "already")));
+  EXPECT_THAT(Log(), IsEmpty());
 }
 
 TEST_F(PgHistoryTest, DropsWholeDayPartitionsPastTheRetention) {
@@ -216,38 +214,73 @@ TEST_F(PgHistoryTest, SpoolsWhileTheDatabaseIsStoppedAndCatchesUp) {
                                  "history rows reach the database again"));
 }
 
-TEST_F(PgHistoryTest, ASpoolOutlivesTheHistoryAndNeverDoublesRows) {
+TEST_F(PgHistoryTest, TwoRunsWriteTheirPartsOfAMinuteAndAReplayNeverDoublesRows) {
   const int64_t minute = kDay0 + 4 * kHour;
+  // An older version's record of 03:58 as written, and its spool files of
+  // 03:58 (written then) and 03:59 (not yet).
+  ASSERT_THAT(Rows("CREATE TABLE written_minutes (minute timestamptz PRIMARY KEY);"
+                   "INSERT INTO written_minutes VALUES (to_timestamp(" +
+                   std::to_string(minute - 120) + "))"),
+              IsEmpty());
+  for (const int64_t old : {minute - 120, minute - 60}) {
+    root_.Write(std::string(kSpool) + "/" + std::to_string(old) + ".rows",
+                SpoolText(old, {Row("cpu.user", old, 6)}));
+  }
   {
     auto history = Make();
-    history->Add({Row("cpu.user", minute, 1)});
+    // The first 20 seconds of 04:00, handed over as the run stops.
+    history->Add({{"cpu.user", minute, 20, 1, 0, 2}});
     ASSERT_TRUE(history->WaitWritten(kWait));
-    // As if a crash came between the minute's commit and its file's removal.
-    root_.Write(std::string(kSpool) + "/" + std::to_string(minute) + ".rows",
-                SpoolText(minute, {Row("cpu.user", minute, 1)}));
+    // As if a crash came between that batch's commit and its file's removal.
+    const std::vector<std::string> written =
+        Rows("SELECT run || '_' || seq FROM written_batches WHERE minute = to_timestamp(" +
+             std::to_string(minute) + ")");
+    ASSERT_EQ(written.size(), 1u);
+    root_.Write(std::string(kSpool) + "/" + std::to_string(minute) + "_" + written[0] + ".rows",
+                SpoolText(minute, {{"cpu.user", minute, 20, 1, 0, 2}}));
     ASSERT_TRUE(pg_.Stop());
     history->Add({Row("cpu.user", minute + 60, 2)});
     history->Add({Row("cpu.user", minute + 120, 3)});
   }
   auto history = Make();
   ASSERT_TRUE(pg_.Start());
+  // The next run: the other 40 seconds of 04:00, then a minute of the next hour.
+  history->Add({{"cpu.user", minute, 40, 5.5, 3, 8}});
+  history->Add({Row("cpu.user", minute + kHour, 7)});
   ASSERT_TRUE(history->WaitWritten(kWait));
   EXPECT_THAT(Rows(kMinuteRowsSql),
-              ElementsAre("cpu.user 1700020800 60 1 1 1", "cpu.user 1700020860 60 2 2 2",
-                          "cpu.user 1700020920 60 3 3 3"));
+              ElementsAre("cpu.user 1700020740 60 6 6 6", "cpu.user 1700020800 20 1 0 2",
+                          "cpu.user 1700020800 40 5.5 3 8", "cpu.user 1700020860 60 2 2 2",
+                          "cpu.user 1700020920 60 3 3 3", "cpu.user 1700024400 60 7 7 7"));
+  // Both parts of 04:00 count by their samples: (20 * 1 + 40 * 5.5 + 60 * 2 + 60 * 3) / 180.
+  EXPECT_THAT(Rows(kHourRowsSql),
+              ElementsAre("cpu.user 1700017200 60 6 6 6", "cpu.user 1700020800 180 3 0 8"));
+  HistoryAnswer answer;
+  std::string error;
+  ASSERT_TRUE(history->Query({"cpu.user"}, minute, minute + 59, 1, answer, error)) << error;
+  ASSERT_EQ(answer.series.size(), 1u);
+  EXPECT_THAT(answer.series[0].times, ElementsAre(minute));
+  EXPECT_THAT(answer.series[0].avg, ElementsAre(4));  // (20 * 1 + 40 * 5.5) / 60
+  EXPECT_THAT(answer.series[0].min, ElementsAre(0));
+  EXPECT_THAT(answer.series[0].max, ElementsAre(8));
+  EXPECT_EQ(SpoolFiles(), 0u);
   const std::vector<std::string> log = Log();
-  EXPECT_THAT(log, Contains("3 minutes of history rows of an earlier run wait in the spool"));
-  EXPECT_THAT(log, Contains(HasSubstr("were in the database already")));
+  EXPECT_THAT(log, Contains("2 batches of history rows of an earlier run wait in the spool"));
+  EXPECT_THAT(log, Contains("3 batches of history rows of an earlier run wait in the spool"));
+  EXPECT_THAT(log, Contains(HasSubstr("rows of 2023-11-15 03:58:00+00 were in the database")));
+  EXPECT_THAT(log, Contains(HasSubstr("rows of 2023-11-15 04:00:00+00 were in the database")));
 }
 
 TEST_F(PgHistoryTest, ReducesEachSeriesOnTheServer) {
-  // Series "a" over three hours and a minute: even minutes 30 samples of
+  // Series "a" over three hours and 21 minutes: even minutes 30 samples of
   // 100 * hour, odd minutes 10 samples of 100 * hour + 40, each within +-5.
-  // Series "b" only in the third hour and the minute after, 60 samples of 7.
+  // Series "b" from the third hour on, 60 samples of 7. Hours 0 to 2 are
+  // rolled up (hour 2: 1200 samples of 210); hour 3 isn't (430 samples of
+  // 133000 / 430, from 295 to 345).
   const int64_t start = kDay0 + 6 * kHour;
   now_ = kDay0 + 2 * kDay;
   std::vector<MinuteRow> rows;
-  for (int i = 0; i <= 180; ++i) {
+  for (int i = 0; i <= 200; ++i) {
     const double avg = 100 * (i / 60) + (i % 2 ? 40 : 0);
     rows.push_back({"a", start + 60 * i, i % 2 ? 10 : 30, avg, avg - 5, avg + 5});
     if (i >= 120) rows.push_back({"b", start + 60 * i, 60, 7, 7, 7});
@@ -282,16 +315,27 @@ TEST_F(PgHistoryTest, ReducesEachSeriesOnTheServer) {
        {start, 10, -5, 45},
        {start + 3480, 10, -5, 45},
        0},
-      {"a row at `to` joins the last point",
+      {"a row at `to` takes a point more: two minutes a point",
        31,
        start,
        start + 3600,
        60,
-       60,
+       120,
        "minute",
-       60,
-       {start, 0, -5, 5},
-       {start + 3540, 85, 35, 105},
+       31,
+       {start, 10, -5, 45},
+       {start + 3600, 100, 95, 105},
+       0},
+      {"an unaligned start keeps its whole first point",
+       31,
+       start + 90,
+       start + 3689,
+       30,
+       180,
+       "minute",
+       21,
+       {start, 400.0 / 70, -5, 45},
+       {start + 3600, 110, 95, 145},
        0},
       {"an hour a point",
        31,
@@ -304,9 +348,9 @@ TEST_F(PgHistoryTest, ReducesEachSeriesOnTheServer) {
        {start, 10, -5, 45},
        {start + 2 * kHour, 210, 195, 245},
        1},
-      {"hours rounded up",
+      {"from 06:30 two hours a point from 06:00",
        31,
-       start,
+       start + 1800,
        start + 3 * kHour - 1,
        2,
        2 * kHour,
@@ -314,6 +358,28 @@ TEST_F(PgHistoryTest, ReducesEachSeriesOnTheServer) {
        2,
        {start, 60, -5, 145},
        {start + 2 * kHour, 210, 195, 245},
+       1},
+      {"the hour not rolled up comes from minute rows",
+       31,
+       start,
+       start + 4 * kHour - 1,
+       4,
+       kHour,
+       "hour",
+       4,
+       {start, 10, -5, 45},
+       {start + 3 * kHour, 133000.0 / 430, 295, 345},
+       2},
+      {"a point of an hour row and minute rows",
+       31,
+       start,
+       start + 4 * kHour - 1,
+       2,
+       2 * kHour,
+       "hour",
+       2,
+       {start, 60, -5, 145},
+       {start + 2 * kHour, (252000.0 + 133000) / 1630, 195, 345},
        1},
       {"older than the minute rows",
        1,
@@ -361,6 +427,8 @@ TEST_F(PgHistoryTest, ReducesEachSeriesOnTheServer) {
   EXPECT_EQ(error, "The history's start must come before its end.");
   EXPECT_FALSE(history->Query({"a"}, start, start + 60, 0, answer, error));
   EXPECT_EQ(error, "The number of points must be at least 1.");
+  EXPECT_FALSE(history->Query({"a"}, -60, start, 10, answer, error));
+  EXPECT_EQ(error, "The history's times must lie between 0 and 2^40.");
 }
 
 TEST_F(PgHistoryTest, AHungServerHoldsNeitherQueriesNorTheStop) {

@@ -30,8 +30,21 @@ CREATE TABLE IF NOT EXISTS hour_rows (
 CREATE INDEX IF NOT EXISTS hour_rows_time ON hour_rows USING brin (time)
   WITH (autosummarize = on);
 CREATE UNIQUE INDEX IF NOT EXISTS hour_rows_series_time ON hour_rows (series_id, time);
-CREATE TABLE IF NOT EXISTS written_minutes (minute timestamptz PRIMARY KEY);
+CREATE TABLE IF NOT EXISTS written_batches (
+  minute timestamptz NOT NULL,
+  run bigint NOT NULL,
+  seq bigint NOT NULL,
+  PRIMARY KEY (minute, run, seq));
 CREATE TABLE IF NOT EXISTS pending_hours (hour timestamptz PRIMARY KEY);
+DO $$ BEGIN
+  -- An older version's record of written minutes: theirs are run 0's, as are
+  -- their spool files.
+  IF to_regclass('written_minutes') IS NOT NULL THEN
+    INSERT INTO written_batches (minute, run, seq) SELECT minute, 0, 0 FROM written_minutes
+      ON CONFLICT DO NOTHING;
+    DROP TABLE IF EXISTS written_minutes;
+  END IF;
+END $$;
 )sql";
 
 const char kSessionSql[] = "SET TimeZone = 'UTC'; SET client_min_messages = warning";
@@ -45,15 +58,15 @@ const char kCopyMinuteRowsSql[] =
     "COPY minute_rows (series_id, time, samples, avg, min, max) FROM STDIN";
 
 const char kMarkWrittenSql[] =
-    "INSERT INTO written_minutes (minute) VALUES (to_timestamp($1::bigint)) "
-    "ON CONFLICT DO NOTHING";
+    "INSERT INTO written_batches (minute, run, seq) "
+    "VALUES (to_timestamp($1::bigint), $2::bigint, $3::bigint) ON CONFLICT DO NOTHING";
 
 const char kMarkHourSql[] =
     "INSERT INTO pending_hours (hour) VALUES (to_timestamp($1::bigint)) ON CONFLICT DO NOTHING";
 
 const char kCompleteHoursSql[] =
     "SELECT extract(epoch FROM hour)::bigint FROM pending_hours "
-    "WHERE hour < (SELECT date_trunc('hour', max(minute)) FROM written_minutes) ORDER BY hour";
+    "WHERE hour < (SELECT date_trunc('hour', max(minute)) FROM written_batches) ORDER BY hour";
 
 const char kRollUpSql[] = R"sql(
 INSERT INTO hour_rows (series_id, time, samples, avg, min, max)
@@ -72,9 +85,9 @@ const char kPartitionsSql[] =
     "SELECT c.relname FROM pg_inherits i JOIN pg_class c ON c.oid = i.inhrelid "
     "WHERE i.inhparent = $1::regclass ORDER BY 1";
 
-// Bookkeeping rows, not history: a few thousand, pruned with the partitions.
-const char kForgetMinutesSql[] =
-    "DELETE FROM written_minutes WHERE minute < to_timestamp($1::bigint)";
+// Bookkeeping rows, not history: about one a minute, pruned with the partitions.
+const char kForgetBatchesSql[] =
+    "DELETE FROM written_batches WHERE minute < to_timestamp($1::bigint)";
 
 const RowTable kRowTables[] = {
     {"minute_rows", &HistorySettings::minute_days},

@@ -2,13 +2,15 @@
 // prune and read them.
 //
 //   series           name -> small integer id
-//   minute_rows      one row per series and minute   } partitioned by range on
+//   minute_rows      rows per series and minute      } partitioned by range on
 //   hour_rows        one row per series and hour     } time, one partition per
 //                                                      UTC day; BRIN on time
 //                                                      for roll-ups, B-tree on
 //                                                      (series, time) for queries
-//   written_minutes  the minutes whose rows are in, written in the same
-//                    transaction as the rows, so a replay never doubles them
+//   written_batches  the spool's batches whose rows are in (minute, run,
+//                    seq), written in the same transaction as the rows, so a
+//                    replay never doubles them; two runs' batches of one
+//                    minute are both written, each a row per series
 //   pending_hours    hours with minutes not yet rolled up into hour_rows
 //
 // Every time is a timestamptz; statements take Unix seconds and convert.
@@ -41,22 +43,24 @@ extern const char kSeriesIdsSql[];
 // COPY of minute rows: series id, time, samples, avg, min, max per line.
 extern const char kCopyMinuteRowsSql[];
 
-// $1 minute: records it as written. Inserts no row when it already was.
+// $1 minute, $2 run, $3 seq: records the batch as written. Inserts no row
+// when it already was.
 extern const char kMarkWrittenSql[];
 // $1 hour: records that the hour has new minutes.
 extern const char kMarkHourSql[];
 // The pending hours before the newest written minute's hour, oldest first.
 extern const char kCompleteHoursSql[];
 // $1 hour, $2 the hour after: the hour's row of every series, made from its
-// minute rows (avg weighted by samples); replaces rows the hour already has.
+// minute rows, a minute's several rows too (avg weighted by samples);
+// replaces rows the hour already has.
 extern const char kRollUpSql[];
 // $1 hour: forgets the pending hours before it.
 extern const char kForgetHoursSql[];
 
 // $1 the parent table's name: the names of its partitions.
 extern const char kPartitionsSql[];
-// $1 time: forgets written minutes before it.
-extern const char kForgetMinutesSql[];
+// $1 time: forgets the written batches of minutes before it.
+extern const char kForgetBatchesSql[];
 
 // The partitioned tables of rows and the settings that say how long their
 // rows are kept, ended by an empty row.

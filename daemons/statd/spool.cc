@@ -20,22 +20,38 @@ constexpr char kSuffix[] = ".rows";
 constexpr char kTempInfix[] = ".tmp.";  // ReplaceFile's temporary names
 constexpr char kHeader[] = "kovastatd spool 1 ";
 
-void AppendNumber(std::string& text, double value) {
-  char buffer[32];
-  const auto result = std::to_chars(buffer, buffer + sizeof(buffer), value);
-  text.append(buffer, result.ptr);
+// Reads a whole number at the start of `text` and advances past it.
+bool TakeNumber(std::string_view& text, int64_t& value) {
+  const auto result = std::from_chars(text.data(), text.data() + text.size(), value);
+  if (result.ec != std::errc()) return false;
+  text.remove_prefix(result.ptr - text.data());
+  return true;
 }
 
-// The minute a spool file's name holds; nullopt for another name.
-std::optional<int64_t> FileMinute(const std::string& name) {
-  const size_t digits = name.size() - (sizeof(kSuffix) - 1);
-  if (name.size() <= sizeof(kSuffix) - 1 || name.compare(digits, std::string::npos, kSuffix) != 0) {
+// The name of batch `id`'s spool file.
+std::string FileName(const BatchId& id) {
+  std::string name = std::to_string(id.minute);
+  if (id.run != 0) name += '_' + std::to_string(id.run) + '_' + std::to_string(id.seq);
+  return name + kSuffix;
+}
+
+// The batch a spool file's name holds: "<minute>_<run>_<seq>.rows", or an
+// older version's "<minute>.rows" (run 0); nullopt for another name.
+std::optional<BatchId> FileBatch(const std::string& name) {
+  std::string_view rest = name;
+  BatchId id;
+  if (!TakeNumber(rest, id.minute)) return std::nullopt;
+  if (rest.starts_with('_')) {
+    rest.remove_prefix(1);
+    if (!TakeNumber(rest, id.run) || !rest.starts_with('_')) return std::nullopt;
+    rest.remove_prefix(1);
+    if (!TakeNumber(rest, id.seq)) return std::nullopt;
+  }
+  // Only the name FileName gives back: no other spelling of the numbers.
+  if (id.run < 0 || id.seq < 0 || (id.run == 0 && id.seq != 0) || FileName(id) != name) {
     return std::nullopt;
   }
-  int64_t minute = 0;
-  const auto result = std::from_chars(name.data(), name.data() + digits, minute);
-  if (result.ec != std::errc() || result.ptr != name.data() + digits) return std::nullopt;
-  return minute;
+  return id;
 }
 
 // Splits `line` at tabs.
@@ -56,6 +72,12 @@ bool ParseNumber(std::string_view text, Number& value) {
 }
 
 }  // namespace
+
+void AppendNumber(std::string& text, double value) {
+  char buffer[32];
+  const auto result = std::to_chars(buffer, buffer + sizeof(buffer), value);
+  text.append(buffer, result.ptr);
+}
 
 std::string SpoolText(int64_t minute, const std::vector<MinuteRow>& rows) {
   std::string text = kHeader + std::to_string(minute) + "\n";
@@ -103,8 +125,8 @@ bool ParseSpoolText(const std::string& text, int64_t minute, std::vector<MinuteR
   return true;
 }
 
-Spool::Spool(std::string dir, uint64_t bound, SystemLog log)
-    : dir_(std::move(dir)), bound_(bound), log_(std::move(log)) {}
+Spool::Spool(std::string dir, uint64_t bound, int64_t run, SystemLog log)
+    : dir_(std::move(dir)), bound_(bound), run_(run), log_(std::move(log)) {}
 
 size_t Spool::Restore() {
   if (!kova::MakeDirectories(dir_, 0750)) {
@@ -116,56 +138,38 @@ size_t Spool::Restore() {
     log_(LOG_ERR, "can't read the history spool " + dir_ + ": " + strerror(errno));
     return 0;
   }
+  size_t restored = 0;
   while (const dirent* file = readdir(stream)) {
     const std::string name = file->d_name;
     struct stat status;
     if (name.find(kTempInfix) != std::string::npos) {
       unlinkat(dirfd(stream), file->d_name, 0);  // a write a crash cut short
-    } else if (const std::optional<int64_t> minute = FileMinute(name);
-               minute && fstatat(dirfd(stream), file->d_name, &status, AT_SYMLINK_NOFOLLOW) == 0 &&
-               S_ISREG(status.st_mode) && entries_.count(*minute) == 0) {
-      entries_[*minute] = {static_cast<uint64_t>(status.st_size), true, {}, 0};
+    } else if (const std::optional<BatchId> id = FileBatch(name);
+               id && id->run != run_ &&
+               fstatat(dirfd(stream), file->d_name, &status, AT_SYMLINK_NOFOLLOW) == 0 &&
+               S_ISREG(status.st_mode) && entries_.count(*id) == 0) {
+      entries_[*id] = {static_cast<uint64_t>(status.st_size), true, {}};
       bytes_ += status.st_size;
+      ++restored;
     }
   }
   closedir(stream);
-  if (!entries_.empty()) {
-    log_(LOG_INFO, std::to_string(entries_.size()) +
-                       " minutes of history rows of an earlier run wait in the spool");
+  if (restored > 0) {
+    log_(LOG_INFO,
+         std::to_string(restored) + " batches of history rows of an earlier run wait in the spool");
   }
-  DropOverBound(-1);
+  DropOverBound(std::nullopt);
   return entries_.size();
 }
 
 void Spool::Put(int64_t minute, std::vector<MinuteRow> rows) {
-  auto found = entries_.find(minute);
-  if (found != entries_.end()) {
-    std::vector<MinuteRow> merged;
-    std::string reason;
-    if (!Load(minute, found->second, merged, reason)) {
-      log_(LOG_ERR, "history rows of " + FilePath(minute) + " are replaced: " + reason);
-    }
-    for (MinuteRow& row : rows) {
-      auto same = merged.begin();
-      while (same != merged.end() && same->series != row.series) ++same;
-      if (same == merged.end()) {
-        merged.push_back(std::move(row));
-      } else {
-        *same = std::move(row);
-      }
-    }
-    rows = std::move(merged);
-  }
-  Entry& entry = entries_[minute];
+  const BatchId id{minute, run_, next_seq_++};
+  Entry& entry = entries_[id];
   const std::string text = SpoolText(minute, rows);
-  bytes_ -= entry.bytes;
   entry.bytes = text.size();
   bytes_ += entry.bytes;
-  ++entry.version;
-  entry.on_disk =
-      kova::MakeDirectories(dir_, 0750) && kova::ReplaceFile(FilePath(minute), text, 0600);
+  entry.on_disk = kova::MakeDirectories(dir_, 0750) && kova::ReplaceFile(FilePath(id), text, 0600);
   if (entry.on_disk) {
-    entry.rows.clear();
     said_unwritable_ = false;
   } else {
     if (!said_unwritable_) {
@@ -175,74 +179,70 @@ void Spool::Put(int64_t minute, std::vector<MinuteRow> rows) {
     said_unwritable_ = true;
     entry.rows = std::move(rows);
   }
-  DropOverBound(minute);
+  DropOverBound(id);
 }
 
 std::optional<SpoolBatch> Spool::Take() {
   while (!entries_.empty()) {
-    const auto& [minute, entry] = *entries_.begin();
-    SpoolBatch batch{minute, {}};
+    const auto& [id, entry] = *entries_.begin();
+    SpoolBatch batch{id, {}};
     std::string reason;
-    if (Load(minute, entry, batch.rows, reason)) {
-      taken_ = minute;
-      taken_version_ = entry.version;
+    if (Load(id, entry, batch.rows, reason)) {
+      taken_ = id;
       return batch;
     }
-    log_(LOG_ERR, "history spool file " + FilePath(minute) + " is dropped: " + reason);
-    Erase(minute);
+    log_(LOG_ERR, "history spool file " + FilePath(id) + " is dropped: " + reason);
+    Erase(batch.id);
   }
   return std::nullopt;
 }
 
-void Spool::Done(int64_t minute, bool written) {
-  if (taken_ != minute) return;
+void Spool::Done(const BatchId& id, bool written) {
+  if (taken_ != id) return;
   taken_.reset();
-  const auto found = entries_.find(minute);
-  if (written && found != entries_.end() && found->second.version == taken_version_) Erase(minute);
+  if (written) Erase(id);
 }
 
-std::string Spool::FilePath(int64_t minute) const {
-  return dir_ + "/" + std::to_string(minute) + kSuffix;
-}
+std::string Spool::FilePath(const BatchId& id) const { return dir_ + "/" + FileName(id); }
 
-bool Spool::Load(int64_t minute, const Entry& entry, std::vector<MinuteRow>& rows,
+bool Spool::Load(const BatchId& id, const Entry& entry, std::vector<MinuteRow>& rows,
                  std::string& reason) const {
   if (!entry.on_disk) {
     rows = entry.rows;
     return true;
   }
   std::string text;
-  if (!kova::ReadWholeFile(FilePath(minute), text)) {
+  if (!kova::ReadWholeFile(FilePath(id), text)) {
     reason = strerror(errno);
     return false;
   }
-  return ParseSpoolText(text, minute, rows, reason);
+  return ParseSpoolText(text, id.minute, rows, reason);
 }
 
-void Spool::Erase(int64_t minute) {
-  const auto found = entries_.find(minute);
+void Spool::Erase(const BatchId& id) {
+  const auto found = entries_.find(id);
   if (found == entries_.end()) return;
-  if (found->second.on_disk && unlink(FilePath(minute).c_str()) != 0 && errno != ENOENT) {
-    log_(LOG_ERR, "can't remove " + FilePath(minute) + ": " + strerror(errno));
+  if (found->second.on_disk && unlink(FilePath(id).c_str()) != 0 && errno != ENOENT) {
+    log_(LOG_ERR, "can't remove " + FilePath(id) + ": " + strerror(errno));
   }
   bytes_ -= found->second.bytes;
   entries_.erase(found);
   if (entries_.empty()) said_full_ = false;
 }
 
-void Spool::DropOverBound(int64_t keep) {
+void Spool::DropOverBound(const std::optional<BatchId>& keep) {
   size_t dropped = 0;
   auto oldest = entries_.begin();
   while (bytes_ > bound_ && oldest != entries_.end()) {
-    const int64_t minute = oldest->first;
+    const BatchId id = oldest->first;
     ++oldest;
-    if (minute == keep || taken_ == minute) continue;
-    Erase(minute);
+    if (id == keep || id == taken_) continue;
+    Erase(id);
     ++dropped;
   }
   if (dropped > 0 && !said_full_) {
     log_(LOG_WARNING, "the history spool is over its " + std::to_string(bound_) +
-                          " bytes; its oldest minutes are dropped");
+                          " bytes; its oldest batches are dropped");
     said_full_ = true;
   }
 }

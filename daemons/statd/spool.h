@@ -1,16 +1,24 @@
-// kovastatd's spool: the minutes of history rows on their way to the
-// database, one file per minute ("<minute>.rows" in the spool directory).
+// kovastatd's spool: batches of history rows on their way to the database,
+// one file per batch in the spool directory.
 //
-// A minute is in its file before Put returns (written to a temporary name,
+// A batch is what one Put takes: rows of one minute. It is named by its
+// minute, the run that made it (a number each PgHistory draws at its start)
+// and its place among that run's batches: "<minute>_<run>_<seq>.rows". So two
+// runs' rows of one minute (a restart within the minute) are two batches, and
+// a batch's name says whether it was written already. Files an older version
+// wrote, "<minute>.rows", are read as run 0's.
+//
+// A batch is in its file before Put returns (written to a temporary name,
 // flushed and renamed, so a crash never leaves half a file), stays there while
 // the database is away, and is removed once written. A restart takes in what
 // the directory holds. The spool is bounded in bytes: past the bound the
-// oldest minutes are dropped, and the log says so once until the spool has
+// oldest batches are dropped, and the log says so once until the spool has
 // been empty again. Not thread-safe: the owner serializes calls.
 
 #ifndef KOVA_DAEMONS_STATD_SPOOL_H_
 #define KOVA_DAEMONS_STATD_SPOOL_H_
 
+#include <compare>
 #include <cstdint>
 #include <functional>
 #include <map>
@@ -25,36 +33,43 @@ namespace statd {
 // Writes one line to the system log: syslog's priority and the text.
 using SystemLog = std::function<void(int priority, const std::string& text)>;
 
-struct SpoolBatch {
+// What names a batch, here and in the database's record of written batches.
+// Ordered oldest minute first.
+struct BatchId {
   int64_t minute = 0;
+  int64_t run = 0;  // the run that made it; 0 for an older version's file
+  int64_t seq = 0;  // the run's batches before it
+  auto operator<=>(const BatchId&) const = default;
+};
+
+struct SpoolBatch {
+  BatchId id;
   std::vector<MinuteRow> rows;
 };
 
 class Spool {
  public:
   // `dir`: the real path of the spool directory, made when missing. `bound`:
-  // the bytes its files may hold together.
-  Spool(std::string dir, uint64_t bound, SystemLog log);
+  // the bytes its files may hold together. `run`: this run's number, above 0.
+  Spool(std::string dir, uint64_t bound, int64_t run, SystemLog log);
 
-  // Takes in the minutes an earlier run left in the directory and removes the
-  // temporary files a crash left. Returns how many minutes wait; 0 (said in
+  // Takes in the batches earlier runs left in the directory and removes the
+  // temporary files a crash left. Returns how many batches wait; 0 (said in
   // the log) when the directory can't be read or made.
   size_t Restore();
 
-  // Keeps `rows`, all of `minute`, after the minutes already kept; rows of a
-  // minute that waits already are merged into it (a series given again
-  // replaces its row). When the file can't be written the minute waits in
-  // memory instead (said in the log), within the same bound.
+  // Keeps `rows`, all of `minute`, as a batch of its own. When the file can't
+  // be written the batch waits in memory instead (said in the log), within
+  // the same bound.
   void Put(int64_t minute, std::vector<MinuteRow> rows);
 
-  // The oldest waiting minute, read back; nullopt when none waits. A file that
-  // can't be read back is removed and said. The minute stays in the spool,
+  // The oldest waiting batch, read back; nullopt when none waits. A file that
+  // can't be read back is removed and said. The batch stays in the spool,
   // never dropped by the bound, until Done.
   std::optional<SpoolBatch> Take();
 
-  // Ends the Take of `minute`: when `written`, removes it, unless a Put
-  // changed it meanwhile (then it waits again).
-  void Done(int64_t minute, bool written);
+  // Ends the Take of `id`: when `written`, removes the batch.
+  void Done(const BatchId& id, bool written);
 
   bool empty() const { return entries_.empty(); }
   size_t size() const { return entries_.size(); }
@@ -63,31 +78,34 @@ class Spool {
  private:
   struct Entry {
     uint64_t bytes = 0;
-    bool on_disk = false;         // else `rows` holds the minute
+    bool on_disk = false;         // else `rows` holds the batch
     std::vector<MinuteRow> rows;  // only while not on disk
-    uint64_t version = 0;         // counts the Puts into this minute
   };
 
-  std::string FilePath(int64_t minute) const;
-  // Reads back the rows of `minute`. False with `reason` when it can't.
-  bool Load(int64_t minute, const Entry& entry, std::vector<MinuteRow>& rows,
+  std::string FilePath(const BatchId& id) const;
+  // Reads back the rows of batch `id`. False with `reason` when it can't.
+  bool Load(const BatchId& id, const Entry& entry, std::vector<MinuteRow>& rows,
             std::string& reason) const;
-  // Forgets `minute` and removes its file.
-  void Erase(int64_t minute);
-  // Drops the oldest minutes, except `keep` and the one taken, while the
+  // Forgets batch `id` and removes its file.
+  void Erase(const BatchId& id);
+  // Drops the oldest batches, except `keep` and the one taken, while the
   // spool is over its bound.
-  void DropOverBound(int64_t keep);
+  void DropOverBound(const std::optional<BatchId>& keep);
 
   std::string dir_;
   uint64_t bound_;
+  int64_t run_;
   SystemLog log_;
-  std::map<int64_t, Entry> entries_;  // by minute, oldest first
+  std::map<BatchId, Entry> entries_;  // oldest first
   uint64_t bytes_ = 0;
-  std::optional<int64_t> taken_;
-  uint64_t taken_version_ = 0;
+  int64_t next_seq_ = 0;
+  std::optional<BatchId> taken_;
   bool said_full_ = false;        // the bound was said since the spool was last empty
   bool said_unwritable_ = false;  // a failed write was said since the last one that worked
 };
+
+// Appends `value` as the shortest text that reads back as the same double.
+void AppendNumber(std::string& text, double value);
 
 // The text of a spool file holding `rows` of `minute`.
 std::string SpoolText(int64_t minute, const std::vector<MinuteRow>& rows);

@@ -22,14 +22,14 @@ for _ in $(seq 100); do
   sleep 0.1
 done
 # The first 20 series of the catalog, as a JSON array.
-series=$(grep -o '"id":"[^"]*"' <<<"$catalog" | head -20 | sed 's/"id"://' | paste -sd, -)
+series=$(grep -o '"id":"[^"]*"' <<<"$catalog" | awk 'NR <= 20' | sed 's/"id"://' | paste -sd, -)
 [ "$(tr ',' '\n' <<<"$series" | wc -l)" -eq 20 ] || { echo "fewer than 20 series: $catalog" >&2; exit 1; }
 echo "waiting 61 s for a minute of samples"
 sleep 61
 path="/webapi/entry.cgi?api=KOVA.ResourceMonitor.Usage&version=1&method=realtime&_sid=$sid"
 path+="&series=$(printf '[%s]' "$series" | sed 's/"/%22/g; s/,/%2C/g; s/\[/%5B/g; s/\]/%5D/g')"
 answer=$(curl -s "${url%/webapi/entry.cgi}$path&since=$(($(date +%s) - 60))")
-samples=$(grep -o '"times":\[[^]]*\]' <<<"$answer" | head -1 | tr ',' '\n' | wc -l)
+samples=$(grep -o '"times":\[[^]]*\]' <<<"$answer" | awk 'NR == 1' | tr ',' '\n' | wc -l)
 [ "$(grep -o '"times":' <<<"$answer" | wc -l)" -eq 20 ] && [ "$samples" -ge 59 ] &&
   [ "$samples" -le 61 ] || { echo "unexpected answer: ${answer:0:300}" >&2; exit 1; }
 echo "an answer holds 20 series of $samples samples ($(wc -c <<<"$answer") bytes)"

@@ -40,12 +40,13 @@ class LogDirectory {
   std::string file_;
 };
 
+// Made when the library loads, so that a test's forked children, which end
+// without destructors, share the directory of the process that removes it.
+const LogDirectory gLogDirectory;
+
 }  // namespace
 
-const std::string& LogFilePath() {
-  static LogDirectory directory;
-  return directory.file();
-}
+const std::string& LogFilePath() { return gLogDirectory.file(); }
 
 void SyncLogFile() {
   if (TheState().log_text) {

@@ -6,7 +6,6 @@
 //   perfeventd_bench [benchmark flags]
 
 #include <benchmark/benchmark.h>
-#include <ftw.h>
 #include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -24,6 +23,7 @@
 #include "sampling/object_directory.h"
 #include "sampling/proc_reader.h"
 #include "test_support/recorded_proc.h"
+#include "test_support/temp_root.h"
 
 namespace perfeventd {
 
@@ -43,9 +43,6 @@ constexpr int kLuns = 25;
 class BenchRoot {
  public:
   BenchRoot() {
-    char pattern[] = "/tmp/perfeventd_bench.XXXXXX";
-    path_ = mkdtemp(pattern);
-    setenv("KOVA_ROOT", path_.c_str(), 1);
     const std::string proc = Proc();
     WriteSystem(proc, 3000, 10000, 8000000, 3000000);
     pid_t pid = 1000;
@@ -69,16 +66,12 @@ class BenchRoot {
                                             path_ + "/volume1 rw - ext4 /dev/sdb1 rw\n");
     for (const char* disk : {"sda", "sdb"}) WriteFile(Sys() + "/block/" + disk + "/device/x", "");
   }
-  ~BenchRoot() {
-    nftw(
-        path_.c_str(), [](const char* file, const struct stat*, int, FTW*) { return remove(file); },
-        16, FTW_DEPTH | FTW_PHYS);
-  }
   std::string Proc() const { return path_ + "/proc"; }
   std::string Sys() const { return path_ + "/sys"; }
 
  private:
-  std::string path_;
+  kova_test::TempRoot root_{"/tmp/perfeventd_bench"};
+  const std::string path_ = root_.path();
 };
 
 // `count` distinct rules: one in ten on the system, one in ten on a LUN, the

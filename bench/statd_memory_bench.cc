@@ -16,10 +16,10 @@
 #include <string>
 #include <thread>
 
-#include "test_support/bench_root.h"
 #include "test_support/collector_client.h"
 #include "test_support/host_call.h"
 #include "test_support/recorded_proc.h"
+#include "test_support/temp_root.h"
 
 namespace {
 
@@ -45,7 +45,7 @@ double StatusMiB(pid_t pid, const char* key) {
 }  // namespace
 
 int main() {
-  const kova_test::BenchRoot root;
+  const kova_test::TempRoot root;
   const kova_test::RecordedMachine shape;
   kova_test::WriteRecordedMachine(root.path(), shape);
   const std::string settings = root.path() + "/etc/kovainfo.conf";

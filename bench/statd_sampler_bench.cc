@@ -24,13 +24,13 @@
 #include "sampling/proc_reader.h"
 #include "sampling/proc_text.h"
 #include "statd/sampler.h"
-#include "test_support/bench_root.h"
 #include "test_support/recorded_proc.h"
+#include "test_support/temp_root.h"
 
 namespace statd {
 namespace {
 
-using kova_test::BenchRoot;
+using kova_test::TempRoot;
 
 constexpr double kBudgetMicroseconds = 10000;  // 1 % of a core at 1 Hz
 const kova_test::RecordedMachine kShape;       // the defaults: 16 CPUs, 8 disks...
@@ -69,7 +69,7 @@ size_t ReadFloor(const std::string& proc, bool mounts) {
 }
 
 void BM_Cycle_Recorded(benchmark::State& state) {
-  BenchRoot root;
+  TempRoot root;
   kova_test::WriteRecordedMachine(root.path(), kShape);
   SamplerOptions options;
   options.proc_dir = root.path() + "/proc";
@@ -94,7 +94,7 @@ void BM_Cycle_Recorded(benchmark::State& state) {
 BENCHMARK(BM_Cycle_Recorded)->MeasureProcessCPUTime()->Unit(benchmark::kMicrosecond);
 
 void BM_Floor_Recorded(benchmark::State& state) {
-  BenchRoot root;
+  TempRoot root;
   kova_test::WriteRecordedMachine(root.path(), kShape);
   size_t files = 0;
   for (auto _ : state) files = ReadFloor(root.path() + "/proc", true);
@@ -105,7 +105,7 @@ BENCHMARK(BM_Floor_Recorded)->MeasureProcessCPUTime()->Unit(benchmark::kMicrosec
 
 // This machine, with one service: this process.
 void BM_Cycle_Live(benchmark::State& state) {
-  BenchRoot root;
+  TempRoot root;
   char text[1024] = "";
   FILE* self = fopen("/proc/self/stat", "r");
   const bool read = self != nullptr && fgets(text, sizeof(text), self) != nullptr;

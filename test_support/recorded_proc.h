@@ -14,6 +14,8 @@
 #include <string>
 #include <vector>
 
+#include "sampling/proc_reader.h"
+
 namespace kova_test {
 
 struct FakeProcess {
@@ -50,18 +52,9 @@ inline void WriteSystem(const std::string& dir, uint64_t busy, uint64_t total,
                                   std::to_string(memory_available_kib) + " kB\n");
 }
 
-// A cpu line of stat: clock ticks of one CPU, or of all (`cpu` -1), in each state.
-struct FakeCpu {
-  int cpu = -1;
-  uint64_t user = 0;
-  uint64_t nice = 0;
-  uint64_t system = 0;
-  uint64_t idle = 0;
-  uint64_t iowait = 0;
-  uint64_t irq = 0;
-  uint64_t softirq = 0;
-  uint64_t steal = 0;
-};
+// A cpu line of stat: clock ticks of one CPU, or of all (`cpu` -1), in each
+// state, as the reader gives them back.
+using FakeCpu = sampling::CpuStates;
 
 // <dir>/stat with these cpu lines, in their order, and the lines that follow them.
 inline void WriteCpuStat(const std::string& dir, const std::vector<FakeCpu>& cpus) {
@@ -111,16 +104,8 @@ inline void WriteLoadAvg(const std::string& dir, double one, double five, double
   WriteFile(dir + "/loadavg", text);
 }
 
-// A network interface's counters.
-struct FakeInterface {
-  std::string name;
-  uint64_t rx_bytes = 0;
-  uint64_t rx_packets = 0;
-  uint64_t rx_errors = 0;
-  uint64_t tx_bytes = 0;
-  uint64_t tx_packets = 0;
-  uint64_t tx_errors = 0;
-};
+// A network interface's counters, as the reader gives them back.
+using FakeInterface = sampling::NetSample;
 
 // <dir>/net/dev with these interfaces, as the kernel writes it.
 inline void WriteNetDev(const std::string& dir, const std::vector<FakeInterface>& interfaces) {

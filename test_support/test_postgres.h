@@ -9,7 +9,6 @@
 #define KOVA_TEST_SUPPORT_TEST_POSTGRES_H_
 
 #include <fcntl.h>
-#include <ftw.h>
 #include <glob.h>
 #include <grp.h>
 #include <libpq-fe.h>
@@ -23,6 +22,8 @@
 #include <fstream>
 #include <string>
 #include <vector>
+
+#include "test_support/temp_root.h"
 
 namespace kova_test {
 
@@ -68,9 +69,7 @@ class TestPostgres {
   ~TestPostgres() {
     if (getpid() != owner_ || dir_.empty()) return;
     if (running_) Stop();
-    nftw(
-        dir_.c_str(), [](const char* file, const struct stat*, int, FTW*) { return remove(file); },
-        16, FTW_DEPTH | FTW_PHYS);
+    RemoveTree(dir_);
   }
   TestPostgres(const TestPostgres&) = delete;
   TestPostgres& operator=(const TestPostgres&) = delete;

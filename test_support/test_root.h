@@ -4,7 +4,6 @@
 #ifndef KOVA_TEST_SUPPORT_TEST_ROOT_H_
 #define KOVA_TEST_SUPPORT_TEST_ROOT_H_
 
-#include <ftw.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -15,37 +14,22 @@
 #include <fstream>
 #include <string>
 
+#include "test_support/temp_root.h"
+
 namespace kova_test {
 
-class TestRoot {
+class TestRoot : public TempRoot {
  public:
   TestRoot() {
-    char pattern[] = "/tmp/kova_root.XXXXXX";
-    if (mkdtemp(pattern) == nullptr) {
+    if (path().empty()) {
       ADD_FAILURE() << "no temporary root";
       return;
     }
-    path_ = pattern;
-    chmod(pattern, 0755);  // for tests that run part of their work as another user
-    setenv("KOVA_ROOT", path_.c_str(), 1);
     for (const char* dir : {"/etc", "/tmp", "/run", "/var"}) {
       std::filesystem::create_directories(Path(dir));
     }
     chmod(Path("/tmp").c_str(), 01777);
   }
-  ~TestRoot() {
-    if (getpid() != owner_ || path_.empty()) return;
-    unsetenv("KOVA_ROOT");
-    nftw(
-        path_.c_str(), [](const char* file, const struct stat*, int, FTW*) { return remove(file); },
-        16, FTW_DEPTH | FTW_PHYS);
-  }
-  TestRoot(const TestRoot&) = delete;
-  TestRoot& operator=(const TestRoot&) = delete;
-
-  const std::string& path() const { return path_; }
-  // The real path of a system path.
-  std::string Path(const std::string& system_path) const { return path_ + system_path; }
 
   // Writes `content` to the system path `system_path`, making its directories.
   void Write(const std::string& system_path, const std::string& content, mode_t mode = 0644) const {
@@ -69,10 +53,6 @@ class TestRoot {
     std::ifstream in(Path(system_path));
     return std::string(std::istreambuf_iterator<char>(in), {});
   }
-
- private:
-  pid_t owner_ = getpid();
-  std::string path_;
 };
 
 }  // namespace kova_test

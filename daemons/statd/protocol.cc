@@ -103,8 +103,7 @@ bool Catalog(const Json::Value&, Collector& collector, Outcome& outcome) {
   data["interval"] = catalog.interval;
   data["realtime_minutes"] = catalog.realtime_minutes;
   data["history"]["enabled"] = catalog.history_enabled;
-  data["history"]["state"] =
-      StateName(catalog.history_enabled ? catalog.history_state : HistoryState::kOff);
+  data["history"]["state"] = StateName(catalog.history_state);
   Json::Value& list = data["series"] = Json::arrayValue;
   for (const SeriesInfo& info : catalog.series) {
     Json::Value series;

@@ -1,5 +1,7 @@
 #include "statd/collector.h"
 
+#include <ctime>
+
 namespace statd {
 namespace {
 
@@ -49,6 +51,10 @@ void Collector::Flush() {
 CatalogAnswer Collector::Catalog() const {
   CatalogAnswer answer;
   answer.interval = interval_;
+  // The log's times are local texts; a client turns them into instants with this.
+  const time_t now = time(nullptr);
+  struct tm local;
+  if (localtime_r(&now, &local) != nullptr) answer.utc_offset = static_cast<int>(local.tm_gmtoff);
   // Under the lock, so that the state belongs to the settings read with it.
   std::lock_guard lock(mutex_);
   answer.history_state = history_.State();

@@ -30,6 +30,7 @@ struct CatalogAnswer {
   int realtime_minutes = 15;
   bool history_enabled = false;
   HistoryState history_state = HistoryState::kOff;
+  int utc_offset = 0;  // seconds east of UTC of the machine's local time now
   std::vector<SeriesInfo> series;
 };
 

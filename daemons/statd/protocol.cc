@@ -104,6 +104,7 @@ bool Catalog(const Json::Value&, Collector& collector, Outcome& outcome) {
   data["realtime_minutes"] = catalog.realtime_minutes;
   data["history"]["enabled"] = catalog.history_enabled;
   data["history"]["state"] = StateName(catalog.history_state);
+  data["utc_offset"] = catalog.utc_offset;
   Json::Value& list = data["series"] = Json::arrayValue;
   for (const SeriesInfo& info : catalog.series) {
     Json::Value series;

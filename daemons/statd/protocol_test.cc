@@ -131,8 +131,15 @@ TEST_F(ProtocolTest, ReloadReadsTheSettingsAndTheCatalogShowsThem) {
   EXPECT_EQ(history_.settings_.minute_days, 7);
   EXPECT_EQ(history_.settings_.hour_days, 1827);
   collector_.Record(1001, {Value("net.rx_bytes@eth0", 5, {{"interface", "eth0"}})});
-  EXPECT_EQ(Ask(R"({"request":"catalog"})")["data"], ParseJson(R"({
+  // Two hours east of UTC all year.
+  setenv("TZ", "Etc/GMT-2", 1);
+  tzset();
+  const Json::Value catalog = Ask(R"({"request":"catalog"})")["data"];
+  unsetenv("TZ");
+  tzset();
+  EXPECT_EQ(catalog, ParseJson(R"({
       "interval":1,"realtime_minutes":30,"history":{"enabled":true,"state":"waiting"},
+      "utc_offset":7200,
       "series":[{"id":"net.rx_bytes@eth0","metric":"net.rx_bytes","unit":"B/s",
                  "labels":{"interface":"eth0"}},
                 {"id":"cpu.user","metric":"cpu.user","unit":"B/s","labels":{}}]})"));

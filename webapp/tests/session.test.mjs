@@ -1,0 +1,50 @@
+// Sign-in, sign-out and an expired session, in German and English, at desk
+// and phone width.
+
+import assert from 'node:assert/strict';
+import {after, before, test} from 'node:test';
+import {launchBrowser, openPage, screenshot, signIn, startSystem} from './system.mjs';
+
+let system;
+let browser;
+before(async () => {
+  system = await startSystem();
+  browser = await launchBrowser();
+});
+after(async () => {
+  await browser?.close();
+  await system?.stop();
+});
+
+test('a wrong password is refused in words, the right one signs in, sign-out returns', async () => {
+  const {context, page, problems} = await openPage(browser, system.url);
+  await page.getByLabel('Account').fill('admin');
+  await page.getByLabel('Password').fill('not the password');
+  await page.getByRole('button', {name: 'Sign in'}).click();
+  await page.getByText('Wrong account name or password.').waitFor();
+  await screenshot(page, 'signin-refused');
+
+  await signIn(page);
+  assert.equal(await page.locator('#account').textContent(), 'admin');
+  await page.getByRole('button', {name: 'Sign out'}).click();
+  await page.getByText('You have signed out.').waitFor();
+  assert.equal(await page.getByRole('navigation', {name: 'Screens'}).count(), 0);
+  // The token lived in the page only: nothing of the session is kept in storage.
+  assert.deepEqual(await page.evaluate(() => [localStorage.length, sessionStorage.length]), [0, 0]);
+  assert.deepEqual(problems, []);
+  await context.close();
+});
+
+test('a session that ends on the server brings back the sign-in with the reason', async () => {
+  const {context, page, problems} = await openPage(browser, system.url, {locale: 'de-DE'});
+  await page.getByLabel('Konto').fill('admin');
+  await page.getByLabel('Passwort').fill('browser test password');
+  await page.getByRole('button', {name: 'Anmelden'}).click();
+  await page.getByRole('navigation', {name: 'Ansichten'}).waitFor();
+  await context.clearCookies();
+  await page.getByRole('link', {name: 'Einstellungen'}).click();
+  await page.getByText('Ihre Sitzung ist abgelaufen. Bitte melden Sie sich erneut an.').waitFor();
+  await screenshot(page, 'signin-expired-de');
+  assert.deepEqual(problems, []);
+  await context.close();
+});

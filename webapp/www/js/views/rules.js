@@ -1,0 +1,8 @@
+// The rules screen.
+
+import {h} from '../ui.js';
+
+export function mount(container) {
+  container.append(h('p', {}, 'rules'));
+  return {unmount() {}};
+}

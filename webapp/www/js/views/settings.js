@@ -1,0 +1,8 @@
+// The settings screen.
+
+import {h} from '../ui.js';
+
+export function mount(container) {
+  container.append(h('p', {}, 'settings'));
+  return {unmount() {}};
+}

@@ -1,0 +1,23 @@
+#!/usr/bin/env bash
+# Runs browser tests of this source tree against the programs of an existing
+# build, without CMake: the web app is put together from webapp/www first.
+#   webapp/tests/run.sh BUILD_DIR [TEST_FILE...]   (default: every *.test.mjs)
+set -euo pipefail
+here=$(cd "$(dirname "$0")" && pwd)
+build=$(cd "${1:?usage: run.sh BUILD_DIR [TEST_FILE...]}" && pwd)
+shift
+www=$(mktemp -d)
+chmod 755 "$www"  # the front-end reads it as an unprivileged account
+trap 'rm -rf "$www"' EXIT
+node "$here/../tools/build_www.mjs" "$here/../www" "$here/../../platform/data/texts" "$www/www"
+export KOVA_WWW=$www/www
+export KOVA_WEBAPID=$build/host/kova-webapid
+export KOVA_TOOL=$build/platform/tools/kova
+export KOVASTATD=$build/daemons/statd/kovastatd
+export KOVAPERFEVENTD=$build/daemons/perfeventd/kovaperfeventd
+export KOVA_MODULES=$build/resourcemonitor/KOVA.ResourceMonitor.so:$build/usage/KOVA.ResourceMonitor.Usage.so
+export KOVA_TEXTS=$here/../../platform/data/texts
+export KOVA_INSTALL_SERVICE=$here/../../daemons/install-service.sh
+export KOVA_SCREENSHOTS=${KOVA_SCREENSHOTS:-$build/screenshots}
+[ $# -gt 0 ] || set -- "$here"/*.test.mjs
+node --test --test-concurrency=1 --test-reporter=spec "$@"

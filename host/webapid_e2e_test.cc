@@ -28,6 +28,7 @@ using kova_test::Code;
 using kova_test::Form;
 using kova_test::ParseJson;
 using kova_test::Reply;
+using ::testing::AllOf;
 using ::testing::HasSubstr;
 using ::testing::Not;
 
@@ -162,8 +163,16 @@ TEST_F(WebApidTest, ServesEveryMethodOfTheModule) {
             true);
   EXPECT_EQ(Call(kRule, "list", {}, sid).json["data"]["total"], 0);
 
+  // The web app, under a policy that lets it load only from the host.
   httplib::Client client("127.0.0.1", host_->port());
-  EXPECT_THAT(client.Get("/")->body, HasSubstr("KOVA Resource Monitor"));
+  const httplib::Result page = client.Get("/");
+  EXPECT_THAT(page->body, HasSubstr("KOVA Resource Monitor"));
+  EXPECT_THAT(page->get_header_value("Content-Security-Policy"),
+              AllOf(HasSubstr("default-src 'none'"), HasSubstr("script-src 'self'"),
+                    Not(HasSubstr("unsafe-inline"))));
+  EXPECT_EQ(client.Get("/js/app.js")->get_header_value("Content-Type"),
+            "text/javascript; charset=utf-8");
+  EXPECT_EQ(client.Get("/favicon.svg")->status, 200);
 
   const std::string log = host_->Log();
   EXPECT_THAT(log, HasSubstr("POST /webapi/entry.cgi 200 api=KOVA.ResourceMonitor.Setting "

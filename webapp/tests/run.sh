@@ -11,13 +11,6 @@ chmod 755 "$www"  # the front-end reads it as an unprivileged account
 trap 'rm -rf "$www"' EXIT
 node "$here/../tools/build_www.mjs" "$here/../www" "$here/../../platform/data/texts" "$www/www"
 export KOVA_WWW=$www/www
-export KOVA_WEBAPID=$build/host/kova-webapid
-export KOVA_TOOL=$build/platform/tools/kova
-export KOVASTATD=$build/daemons/statd/kovastatd
-export KOVAPERFEVENTD=$build/daemons/perfeventd/kovaperfeventd
-export KOVA_MODULES=$build/resourcemonitor/KOVA.ResourceMonitor.so:$build/usage/KOVA.ResourceMonitor.Usage.so
-export KOVA_TEXTS=$here/../../platform/data/texts
-export KOVA_INSTALL_SERVICE=$here/../../daemons/install-service.sh
-export KOVA_SCREENSHOTS=${KOVA_SCREENSHOTS:-$build/screenshots}
+source "$here/env.sh" "$build"
 [ $# -gt 0 ] || set -- "$here"/*.test.mjs
 node --test --test-concurrency=1 --test-reporter=spec "$@"

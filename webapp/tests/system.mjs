@@ -33,8 +33,9 @@ export async function waitFor(check, what, ms = 15000) {
 }
 
 // Starts the system. `settings` are lines of /etc/kovainfo.conf;
-// `perfeventTimeScale` runs the event daemon's periods and windows faster.
-export async function startSystem({settings = {}, perfeventTimeScale = 0.1} = {}) {
+// `perfeventTimeScale` runs the event daemon's periods and windows faster;
+// `statdOptions` are kovastatd's.
+export async function startSystem({settings = {}, perfeventTimeScale = 0.1, statdOptions = ''} = {}) {
   const root = mkdtempSync(join(tmpdir(), 'kova-browser-'));
   const env = {...process.env, KOVA_ROOT: root};
   const kova = (args, input = '') =>
@@ -56,7 +57,7 @@ export async function startSystem({settings = {}, perfeventTimeScale = 0.1} = {}
   const install = (name, program, options) => execFileSync(need('KOVA_INSTALL_SERVICE'), [
     root, name, '/bin/sh', '-c', `exec ${program} ${options} --log-stderr 2>>${root}/${name}.err`,
   ], {env, stdio: 'ignore'});
-  install('kovastatd', need('KOVASTATD'), '');
+  install('kovastatd', need('KOVASTATD'), statdOptions);
   install('kovaperfeventd', need('KOVAPERFEVENTD'), `--time-scale ${perfeventTimeScale}`);
   kova(['service', 'start', 'kovastatd']);
 

@@ -164,8 +164,12 @@ export async function mount(container) {
     }
     pager.hidden = total === 0;
     range.textContent = t('log.range', {first: offset + 1, last: offset + logs.length, total});
+    const focused = document.activeElement;
     previous.disabled = offset === 0;
     next.disabled = offset + logs.length >= total;
+    // Keyboard focus stays in the pager when the end is reached.
+    if (focused === next && next.disabled) previous.focus();
+    if (focused === previous && previous.disabled) next.focus();
   }
 
   async function load() {

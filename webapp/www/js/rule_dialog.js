@@ -136,20 +136,16 @@ function measureOf(type, object, resource, series) {
 function objectChoices(series, rule) {
   const system = rule?.type === 0 ? rule : {type: 0, service: ''};
   const choices = [{type: 0, object: system.service, name: ruleObject(system)}];
-  const seen = new Set();
-  const add = (choice) => {
-    if (seen.has(`${choice.type}:${choice.object}`)) return;
-    seen.add(`${choice.type}:${choice.object}`);
-    choices.push(choice);
-  };
   series.filter((one) => one.metric === 'service.cpu' || one.metric === 'lun.io')
     .map((one) => (one.metric === 'service.cpu'
       ? {type: 1, object: one.labels.service, name: one.labels.display_name || one.labels.service}
       : {type: 2, object: one.labels.lun, name: one.labels.name || one.labels.lun}))
     .sort((a, b) => a.name.localeCompare(b.name, locale))
-    .forEach(add);
+    .forEach((choice) => choices.push(choice));
   // A rule's object that isn't measured now (a stopped service) stays choosable.
-  if (rule && rule.type !== 0) add({type: rule.type, object: rule.service, name: ruleObject(rule)});
+  if (rule && !choices.some((choice) => choice.type === rule.type && choice.object === rule.service)) {
+    choices.push({type: rule.type, object: rule.service, name: ruleObject(rule)});
+  }
   return choices;
 }
 
@@ -185,8 +181,8 @@ export async function openRuleDialog(rule) {
   const plot = h('div', {class: 'rule-chart', dataset: {points: '0'}});
   const empty = h('p', {class: 'muted rule-empty'});
   const save = h('button', {class: 'primary'}, t('rule.save'));
-  const field = (label, control, suffix = null) => h('div', {class: 'field'}, h('label', {for: control.id}, label),
-    suffix ? h('span', {class: 'rule-with-unit'}, control, suffix) : control);
+  const field = (label, control, suffix = null) => h('div', {class: 'field'},
+    h('label', {for: control.id}, label), suffix ? h('span', {class: 'rule-with-unit'}, control, suffix) : control);
   const dialog = h('dialog', {class: 'rule-dialog', 'aria-labelledby': 'rule-heading'},
     h('form', {class: 'rule-form', novalidate: true, onsubmit: submit},
       h('h3', {id: 'rule-heading'}, t(rule ? 'rule.edit' : 'rule.new')),

@@ -43,7 +43,7 @@ export function joinSeries(ids, history, step, live, bucket, from) {
     if (first !== undefined) liveStart = Math.min(liveStart, first);
   }
   const shared = Math.ceil(liveStart / bucket) * bucket;
-  const parts = new Map();
+  const pieces = new Map();
   const all = new Set();
   for (const id of ids) {
     const points = history.get(id) ?? {times: [], avg: [], min: [], max: []};
@@ -52,10 +52,10 @@ export function joinSeries(ids, history, step, live, bucket, from) {
     const kept = points.times.filter((time) => time + step <= cut).length;
     const samples = live.get(id) ?? {times: [], values: []};
     const tail = bucketSamples(samples.times, samples.values, finer ? bucket : step, Math.max(cut, from));
-    const part = {};
-    for (const key of ['times', 'avg', 'min', 'max']) part[key] = points[key].slice(0, kept).concat(tail[key]);
-    parts.set(id, part);
-    for (const time of part.times) all.add(time);
+    const piece = {};
+    for (const key of ['times', 'avg', 'min', 'max']) piece[key] = points[key].slice(0, kept).concat(tail[key]);
+    pieces.set(id, piece);
+    for (const time of piece.times) all.add(time);
   }
   const times = [];
   for (const time of [...all].sort((a, b) => a - b)) {
@@ -64,11 +64,11 @@ export function joinSeries(ids, history, step, live, bucket, from) {
   }
   const index = new Map(times.map((time, i) => [time, i]));
   const series = new Map();
-  for (const [id, part] of parts) {
+  for (const [id, piece] of pieces) {
     const arrays = {avg: [], min: [], max: []};
     for (const key of ['avg', 'min', 'max']) {
       arrays[key] = new Array(times.length).fill(null);
-      part.times.forEach((time, i) => (arrays[key][index.get(time)] = part[key][i]));
+      piece.times.forEach((time, i) => (arrays[key][index.get(time)] = piece[key][i]));
     }
     series.set(id, arrays);
   }

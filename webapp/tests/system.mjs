@@ -6,7 +6,8 @@
 import {execFileSync, spawn} from 'node:child_process';
 import {chmodSync, cpSync, mkdirSync, mkdtempSync, readFileSync, rmSync, symlinkSync, writeFileSync} from 'node:fs';
 import {tmpdir} from 'node:os';
-import {basename, join} from 'node:path';
+import {basename, dirname, join} from 'node:path';
+import {fileURLToPath} from 'node:url';
 import {chromium} from 'playwright-core';
 
 export const kAccount = 'admin';
@@ -34,8 +35,11 @@ export async function waitFor(check, what, ms = 15000) {
 
 // Starts the system. `settings` are lines of /etc/kovainfo.conf;
 // `perfeventTimeScale` runs the event daemon's periods and windows faster;
-// `statdOptions` are kovastatd's.
-export async function startSystem({settings = {}, perfeventTimeScale = 0.1, statdOptions = ''} = {}) {
+// `statdOptions` go to kovastatd ("--time-scale 0.05": a minute in 3 s);
+// `database` starts the real PostgreSQL as the service "pgsql" first (as root,
+// it runs as the account kovapgsql that scripts/setup makes).
+export async function startSystem({settings = {}, perfeventTimeScale = 0.1, statdOptions = '',
+                                   database = false} = {}) {
   const root = mkdtempSync(join(tmpdir(), 'kova-browser-'));
   chmodSync(root, 0o755);  // a host started as root reads the root as its account
   const env = {...process.env, KOVA_ROOT: root};
@@ -59,6 +63,13 @@ export async function startSystem({settings = {}, perfeventTimeScale = 0.1, stat
   const install = (name, program, options) => execFileSync(need('KOVA_INSTALL_SERVICE'), [
     root, name, '/bin/sh', '-c', `exec ${program} ${options} --log-stderr 2>>${root}/${name}.err`,
   ], {env, stdio: 'ignore'});
+  if (database) {
+    const pgsql = process.env.KOVA_PGSQL_DIR ?? join(dirname(fileURLToPath(import.meta.url)), '../../daemons/pgsql');
+    mkdirSync(join(root, 'usr/sbin'), {recursive: true});
+    cpSync(join(pgsql, 'kova-pgsql'), join(root, 'usr/sbin/kova-pgsql'));
+    execFileSync(join(pgsql, 'install-service.sh'), [root], {env, stdio: 'ignore'});
+    kova(['service', 'start', 'pgsql']);
+  }
   install('kovastatd', need('KOVASTATD'), statdOptions);
   install('kovaperfeventd', need('KOVAPERFEVENTD'), `--time-scale ${perfeventTimeScale}`);
   kova(['service', 'start', 'kovastatd']);
@@ -91,7 +102,7 @@ export async function startSystem({settings = {}, perfeventTimeScale = 0.1, stat
     async stop() {
       host.kill('SIGTERM');
       await new Promise((resolve) => (host.exitCode !== null ? resolve() : host.once('exit', resolve)));
-      for (const service of ['kovaperfeventd', 'kovastatd']) {
+      for (const service of ['kovaperfeventd', 'kovastatd', ...(database ? ['pgsql'] : [])]) {
         try {
           kova(['service', 'stop', service]);
         } catch {

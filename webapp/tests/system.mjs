@@ -4,7 +4,7 @@
 // passes the programs' paths in the environment (webapp/CMakeLists.txt).
 
 import {execFileSync, spawn} from 'node:child_process';
-import {cpSync, mkdirSync, mkdtempSync, readFileSync, rmSync, symlinkSync, writeFileSync} from 'node:fs';
+import {chmodSync, cpSync, mkdirSync, mkdtempSync, readFileSync, rmSync, symlinkSync, writeFileSync} from 'node:fs';
 import {tmpdir} from 'node:os';
 import {basename, join} from 'node:path';
 import {chromium} from 'playwright-core';
@@ -36,12 +36,14 @@ export async function waitFor(check, what, ms = 15000) {
 // `perfeventTimeScale` runs the event daemon's periods and windows faster.
 export async function startSystem({settings = {}, perfeventTimeScale = 0.1} = {}) {
   const root = mkdtempSync(join(tmpdir(), 'kova-browser-'));
+  chmodSync(root, 0o755);  // a host started as root reads the root as its account
   const env = {...process.env, KOVA_ROOT: root};
   const kova = (args, input = '') =>
     execFileSync(need('KOVA_TOOL'), args, {env, input, encoding: 'utf8'});
   for (const dir of ['etc/kova/services', 'run/kova', 'tmp', 'var/log', 'modules', 'usr/share/kova']) {
     mkdirSync(join(root, dir), {recursive: true});
   }
+  chmodSync(join(root, 'tmp'), 0o1777);
   cpSync(need('KOVA_TEXTS'), join(root, 'usr/share/kova/texts'), {recursive: true});
   for (const module of need('KOVA_MODULES').split(':')) {
     symlinkSync(module, join(root, 'modules', basename(module)));

@@ -95,11 +95,12 @@ function thresholdPlugin(threshold) {
 //   series: [{label, color}]; with bands, each is drawn from three arrays
 //     (average, minimum, maximum);
 //   height (200), yRange ([min, max] or null for automatic, never below 0),
-//   onSelect(from, to): called when the user drags over a time range.
+//   onSelect(from, to): called when the user drags over a time range;
+//   live: the legend shows the newest values while the cursor is off the chart.
 // Returns {setData(times, arrays), setMarkers(list), setThreshold(value),
 // setWindow(from, to), destroy()}.
 export function createChart(container, options) {
-  const {unit, series, height = 200, bands = false, yRange = null, onSelect = null} = options;
+  const {unit, series, height = 200, bands = false, yRange = null, onSelect = null, live = false} = options;
   let markers = [];
   let threshold = null;
   let window = null;
@@ -111,12 +112,24 @@ export function createChart(container, options) {
   wrapper.append(tooltip);
   container.append(wrapper);
 
-  const plotSeries = [{value: (u, v) => (v === null ? '–' : formatTime(v))}];
+  // With `live`, a legend without a cursor index takes the series' newest value.
+  const newest = (u, v, index, idx) => {
+    if (!live || idx !== null) return v;
+    const values = u.data[index];
+    for (let at = values.length - 1; at >= 0 && at >= values.length - 5; at -= 1) {
+      if (values[at] !== null) return values[at];
+    }
+    return null;
+  };
+  const plotSeries = [{value: (u, v, s, idx) => {
+    const time = newest(u, v, s, idx);
+    return time === null || time === undefined ? '–' : formatTime(time);
+  }}];
   const plotBands = [];
   series.forEach((one, index) => {
     const color = one.color ?? kPalette[index % kPalette.length];
     const line = {label: one.label, stroke: color, width: 1.5, points: {show: false},
-                  value: (u, v) => formatValue(v, unit)};
+                  value: (u, v, s, idx) => formatValue(newest(u, v, s, idx), unit)};
     if (!bands) {
       plotSeries.push(line);
       return;

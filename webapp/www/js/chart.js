@@ -3,6 +3,9 @@
 // hover. Times are Unix seconds.
 
 import {formatTime, formatValue} from './format.js';
+import {define, t} from './i18n.js';
+
+define({enu: {'chart.time': 'Time'}, ger: {'chart.time': 'Zeit'}});
 
 // The colour of each event level, on charts and in the log.
 export const kLevelColors = {Info: '#2f6fba', Warning: '#d48a00', Critical: '#c62828'};
@@ -121,7 +124,7 @@ export function createChart(container, options) {
     }
     return null;
   };
-  const plotSeries = [{value: (u, v, s, idx) => {
+  const plotSeries = [{label: t('chart.time'), value: (u, v, s, idx) => {
     const time = newest(u, v, s, idx);
     return time === null || time === undefined ? '–' : formatTime(time);
   }}];

@@ -15,6 +15,13 @@ function lowerBound(list, value) {
   return low;
 }
 
+// Drops the first `count` elements of `list`. shift() moves the array's start
+// instead of its elements, which makes the second-by-second cut cheap.
+function cut(list, count) {
+  if (count > 64) list.splice(0, count);
+  else for (let i = 0; i < count; i += 1) list.shift();
+}
+
 // The times of every answered series after `after`, sorted, each once.
 function newTimes(answered, after) {
   let first = null;
@@ -122,8 +129,8 @@ export class LiveStore {
   trim(oldest) {
     const count = lowerBound(this.times, oldest);
     if (count === 0) return 0;
-    this.times.splice(0, count);
-    for (const {values} of this.#series.values()) values.splice(0, count);
+    cut(this.times, count);
+    for (const {values} of this.#series.values()) cut(values, count);
     return count;
   }
 }

@@ -84,8 +84,8 @@ define({
 const kEventMilliseconds = 5000;
 const kChartHeight = 180;
 const busy = (idle) => 100 - idle;
-// The lowest top of a y axis by unit, so that an idle rate has no axis of fractions of a byte.
-const kFloor = {'B/s': [0, 1024]};
+// The lowest top of a y axis by unit, so that an idle chart has no axis of fractions.
+const kFloor = {'B': [0, 1024], 'B/s': [0, 1024], 'IO/s': [0, 10], 'ms': [0, 10]};
 
 // The objects of `metric` in catalog order: [{name, labels}].
 function objectsOf(catalogSeries, metric) {
@@ -176,8 +176,8 @@ export function mount(container) {
   const grid = h('div', {class: 'grid live-charts'});
   container.append(h('div', {class: 'toolbar'}, intro, coreField), notice, grid);
 
-  // Charts on screen are drawn every second, one out of view a second in turn;
-  // one that comes into view catches up at once.
+  // Only charts on screen are drawn every second; one that comes into view
+  // catches up at once.
   const cards = new Map();  // card → chart entry
   const seen = new IntersectionObserver((changes) => {
     for (const change of changes) {
@@ -240,6 +240,7 @@ export function mount(container) {
       cards.set(card, one);
       seen.observe(card);
     });
+    for (const one of charts) refresh(one);
   }
 
   // Brings a chart up to the samples and markers held.
@@ -256,16 +257,8 @@ export function mount(container) {
     }
   }
 
-  let turn = 0;
   function draw() {
-    let hidden = null;
-    for (let i = 0; i < charts.length; i += 1) {
-      const one = charts[(turn + i) % charts.length];
-      if (one.visible) refresh(one);
-      else if (!hidden && (one.version !== version || one.markers !== markers)) hidden = one;
-    }
-    if (hidden) refresh(hidden);
-    turn += 1;
+    for (const one of charts) if (one.visible) refresh(one);
   }
 
   async function loadEvents(now) {

@@ -1,6 +1,6 @@
 // The services screen against the real collector: the running services of
 // the root by their display names, ordered by CPU and by memory, the top ten
-// and all of them.
+// and all of them, and one that stops leaving.
 
 import assert from 'node:assert/strict';
 import {writeFileSync} from 'node:fs';
@@ -68,6 +68,10 @@ test('the top list orders services by CPU, by memory when asked, and shows all o
 
   await page.getByRole('button', {name: 'Show all 12'}).click();
   assert.equal(await rows.count(), 12);
+  // A stopped service leaves the list, though its samples are still in the window.
+  system.kova(['service', 'stop', 'sleeper10']);
+  await waitFor(async () => !(await names()).includes('sleeper10'), 'the stopped service to leave');
+  assert.equal(await rows.count(), 11);
   await page.getByRole('button', {name: 'Show the top 10'}).click();
   assert.equal(await rows.count(), 10);
 

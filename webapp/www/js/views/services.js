@@ -32,17 +32,20 @@ define({
 });
 
 const kTop = 10;
+// A service whose newest sample is this much older than the newest of all has
+// stopped; the collector keeps its series while the window holds its samples.
+const kStoppedSeconds = 3;
 const kNames = new Intl.Collator(locale, {numeric: true});
 const kMetrics = {'service.cpu': 'cpu', 'service.memory': 'memory'};
 
 // Services in the order of `key` ("cpu" or "memory"), highest first, then by name.
 function ranked(services, key) {
-  return [...services].sort((a, b) => ((b[key] ?? -1) - (a[key] ?? -1)) ||
+  return services.sort((a, b) => ((b[key] ?? -1) - (a[key] ?? -1)) ||
                                       kNames.compare(a.display, b.display));
 }
 
 export function mount(container) {
-  const services = new Map();  // name → {name, display, cpu, memory}
+  const services = new Map();  // name → {name, display, cpu, memory, time}
   const columns = new Map();   // series id → [service name, "cpu" or "memory"]
   let loaded = false;
   let sortKey = 'cpu';
@@ -80,7 +83,7 @@ export function mount(container) {
       if (key === sortKey) header.setAttribute('aria-sort', 'descending');
       else header.removeAttribute('aria-sort');
     }
-    const list = ranked(services.values(), sortKey);
+    const list = ranked([...services.values()].filter((one) => one.time >= since - kStoppedSeconds), sortKey);
     const shown = showAll ? list : list.slice(0, kTop);
     body.replaceChildren(...shown.map((one) => h('tr', {dataset: {service: one.name}},
       h('td', {}, one.display, one.display !== one.name ? h('span', {class: 'muted service-id'}, one.name) : null),
@@ -105,7 +108,7 @@ export function mount(container) {
       columns.set(one.id, [name, key]);
       const known = services.get(name);
       if (known) known.display = display;
-      else services.set(name, {name, display, cpu: null, memory: null});
+      else services.set(name, {name, display, cpu: null, memory: null, time: 0});
     }
     for (const name of services.keys()) if (!names.has(name)) services.delete(name);
     return [...columns.keys()];
@@ -123,7 +126,8 @@ export function mount(container) {
           const service = services.get(name);
           if (!service || one.times.length === 0) continue;
           service[key] = one.values[one.values.length - 1];
-          since = Math.max(since, one.times[one.times.length - 1]);
+          service.time = Math.max(service.time, one.times[one.times.length - 1]);
+          since = Math.max(since, service.time);
         }
       }
       loaded = true;

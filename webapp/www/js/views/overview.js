@@ -211,30 +211,30 @@ export function mount(container) {
     lastCatalog = answer;
     entries = merge(answer.series ?? []);
     const layout = layoutOf(entries, perCore);
-    const drawn = layout.filter((spec) => !spec.empty);
-    const signature = JSON.stringify(drawn.map((spec) => [spec.key, spec.series.map((one) => one.id)]));
+    const drawn = layout.filter((item) => !item.empty);
+    const signature = JSON.stringify(drawn.map((item) => [item.key, item.series.map((one) => one.id)]));
     coreField.hidden = !entries.some((one) => one.metric === 'cpu.idle' && one.labels?.cpu);
     intro.textContent = t('overview.window', {minutes: answer.realtime_minutes});
     if (signature === planned) return;
     planned = signature;
-    store.keep(drawn.flatMap((spec) => spec.series));
+    store.keep(drawn.flatMap((item) => item.series));
     destroyCharts();
     grid.replaceChildren();
-    layout.forEach((spec, index) => {
-      const heading = h('h3', {id: `overview-chart-${index}`}, spec.title);
-      if (spec.empty) {
+    layout.forEach((item, index) => {
+      const heading = h('h3', {id: `overview-chart-${index}`}, item.title);
+      if (item.empty) {
         grid.append(h('section', {class: 'card chart-card empty', 'aria-labelledby': heading.id,
-                                  dataset: {chart: spec.key}}, heading, h('p', {class: 'muted'}, spec.empty)));
+                                  dataset: {chart: item.key}}, heading, h('p', {class: 'muted'}, item.empty)));
         return;
       }
       const box = h('div', {class: 'chart-box'});
       const card = h('section', {class: 'card chart-card', 'aria-labelledby': heading.id,
-                                 dataset: {chart: spec.key, points: '0', markers: '0'}}, heading, box);
+                                 dataset: {chart: item.key, points: '0', markers: '0'}}, heading, box);
       grid.append(card);
-      const chart = createChart(box, {unit: spec.unit, height: kChartHeight, live: true,
-                                      yRange: spec.yRange ?? kFloor[spec.unit] ?? null,
-                                      series: spec.series.map(({label}) => ({label}))});
-      const one = {card, chart, arrays: spec.series.map(({id}) => store.values(id)),
+      const chart = createChart(box, {unit: item.unit, height: kChartHeight, live: true,
+                                      yRange: item.yRange ?? kFloor[item.unit] ?? null,
+                                      series: item.series.map(({label}) => ({label}))});
+      const one = {card, chart, arrays: item.series.map(({id}) => store.values(id)),
                    visible: false, version: -1, markers: null};
       charts.push(one);
       cards.set(card, one);

@@ -3,6 +3,9 @@
 // hover. Times are Unix seconds.
 
 import {formatTime, formatValue} from './format.js';
+import {define, t} from './i18n.js';
+
+define({enu: {'chart.time': 'Time'}, ger: {'chart.time': 'Zeit'}});
 
 // The colour of each event level, on charts and in the log.
 export const kLevelColors = {Info: '#2f6fba', Warning: '#d48a00', Critical: '#c62828'};
@@ -95,11 +98,12 @@ function thresholdPlugin(threshold) {
 //   series: [{label, color}]; with bands, each is drawn from three arrays
 //     (average, minimum, maximum);
 //   height (200), yRange ([min, max] or null for automatic, never below 0),
-//   onSelect(from, to): called when the user drags over a time range.
+//   onSelect(from, to): called when the user drags over a time range;
+//   live: the legend shows the newest values while the cursor is off the chart.
 // Returns {setData(times, arrays), setMarkers(list), setThreshold(value),
 // setWindow(from, to), destroy()}.
 export function createChart(container, options) {
-  const {unit, series, height = 200, bands = false, yRange = null, onSelect = null} = options;
+  const {unit, series, height = 200, bands = false, yRange = null, onSelect = null, live = false} = options;
   let markers = [];
   let threshold = null;
   let window = null;
@@ -111,12 +115,24 @@ export function createChart(container, options) {
   wrapper.append(tooltip);
   container.append(wrapper);
 
-  const plotSeries = [{value: (u, v) => (v === null ? '–' : formatTime(v))}];
+  // With `live`, a legend without a cursor index takes the series' newest value.
+  const newest = (u, v, index, idx) => {
+    if (!live || idx !== null) return v;
+    const values = u.data[index];
+    for (let at = values.length - 1; at >= 0 && at >= values.length - 5; at -= 1) {
+      if (values[at] !== null) return values[at];
+    }
+    return null;
+  };
+  const plotSeries = [{label: t('chart.time'), value: (u, v, s, idx) => {
+    const time = newest(u, v, s, idx);
+    return time === null || time === undefined ? '–' : formatTime(time);
+  }}];
   const plotBands = [];
   series.forEach((one, index) => {
     const color = one.color ?? kPalette[index % kPalette.length];
     const line = {label: one.label, stroke: color, width: 1.5, points: {show: false},
-                  value: (u, v) => formatValue(v, unit)};
+                  value: (u, v, s, idx) => formatValue(newest(u, v, s, idx), unit)};
     if (!bands) {
       plotSeries.push(line);
       return;

@@ -5,8 +5,17 @@ import {locale} from './i18n.js';
 
 const kBinary = ['', 'Ki', 'Mi', 'Gi', 'Ti', 'Pi'];
 
+// Formatters are made once: making one per call is slow, and charts call these
+// for every label on every update.
+const numberFormats = [];
+const timeFormat = new Intl.DateTimeFormat(locale, {
+  year: 'numeric', month: '2-digit', day: '2-digit',
+  hour: '2-digit', minute: '2-digit', second: '2-digit',
+});
+
 function number(value, digits) {
-  return value.toLocaleString(locale, {maximumFractionDigits: digits, minimumFractionDigits: 0});
+  numberFormats[digits] ??= new Intl.NumberFormat(locale, {maximumFractionDigits: digits, minimumFractionDigits: 0});
+  return numberFormats[digits].format(value);
 }
 
 // 1536 → "1.5 KiB"; `suffix` follows the prefix ("B", "B/s").
@@ -43,8 +52,5 @@ export function formatValue(value, unit) {
 
 // Unix seconds as local date and time, to the second.
 export function formatTime(seconds) {
-  return new Date(seconds * 1000).toLocaleString(locale, {
-    year: 'numeric', month: '2-digit', day: '2-digit',
-    hour: '2-digit', minute: '2-digit', second: '2-digit',
-  });
+  return timeFormat.format(seconds * 1000);
 }

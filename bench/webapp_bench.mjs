@@ -22,7 +22,8 @@ let failed = false;
 try {
   // First load: every HTML, script and style answer from the sign-in to the
   // overview's charts, uncompressed as the host sends them.
-  const {page, problems} = await openPage(browser, 'about:blank');
+  // Tall enough that every chart is on screen and drawn on each update.
+  const {page, problems} = await openPage(browser, 'about:blank', {viewport: {width: 1280, height: 3000}});
   const loaded = new Map();
   page.on('response', async (response) => {
     const type = response.request().resourceType();

@@ -2,10 +2,13 @@
 // threshold line, and performance events drawn as markers whose text shows on
 // hover. Times are Unix seconds.
 
-import {formatTime, formatValue} from './format.js';
+import {formatAxisTimes, formatTime, formatValue} from './format.js';
 import {define, t} from './i18n.js';
 
-define({enu: {'chart.time': 'Time'}, ger: {'chart.time': 'Zeit'}});
+define({
+  enu: {'chart.time': 'Time', 'chart.min': '{label} min', 'chart.max': '{label} max'},
+  ger: {'chart.time': 'Zeit', 'chart.min': '{label} Min.', 'chart.max': '{label} Max.'},
+});
 
 // The colour of each event level, on charts and in the log.
 export const kLevelColors = {Info: '#2f6fba', Warning: '#d48a00', Critical: '#c62828'};
@@ -139,9 +142,9 @@ export function createChart(container, options) {
     }
     const first = plotSeries.length;
     plotSeries.push(line,
-                    {label: `${one.label} min`, stroke: 'transparent', points: {show: false},
+                    {label: t('chart.min', {label: one.label}), stroke: 'transparent', points: {show: false},
                      value: (u, v) => formatValue(v, unit)},
-                    {label: `${one.label} max`, stroke: 'transparent', points: {show: false},
+                    {label: t('chart.max', {label: one.label}), stroke: 'transparent', points: {show: false},
                      value: (u, v) => formatValue(v, unit)});
     plotBands.push({series: [first + 2, first + 1], fill: `${color}33`});
   });
@@ -160,7 +163,7 @@ export function createChart(container, options) {
       x: {time: true, range: (u, min, max) => (window ? window : [min, max])},
       y: {range},
     },
-    axes: [{}, {values: (u, values) => values.map((v) => formatValue(v, unit)), size: 80}],
+    axes: [{values: (u, ticks, axis, space, step) => formatAxisTimes(ticks, step)}, {values: (u, values) => values.map((v) => formatValue(v, unit)), size: 80}],
     legend: {live: true},
     cursor: {drag: {x: Boolean(onSelect), y: false, setScale: false}},
     plugins: [markerPlugin(() => markers, tooltip), thresholdPlugin(() => threshold)],

@@ -13,6 +13,12 @@ const timeFormat = new Intl.DateTimeFormat(locale, {
   hour: '2-digit', minute: '2-digit', second: '2-digit',
 });
 
+const axisFormats = {
+  second: new Intl.DateTimeFormat(locale, {hour: '2-digit', minute: '2-digit', second: '2-digit'}),
+  minute: new Intl.DateTimeFormat(locale, {hour: '2-digit', minute: '2-digit'}),
+  day: new Intl.DateTimeFormat(locale, {day: '2-digit', month: '2-digit'}),
+};
+
 function number(value, digits) {
   numberFormats[digits] ??= new Intl.NumberFormat(locale, {maximumFractionDigits: digits, minimumFractionDigits: 0});
   return numberFormats[digits].format(value);
@@ -53,4 +59,20 @@ export function formatValue(value, unit) {
 // Unix seconds as local date and time, to the second.
 export function formatTime(seconds) {
   return timeFormat.format(seconds * 1000);
+}
+
+// The labels of a time axis whose ticks lie `step` seconds apart: times of
+// day, with the date under the first tick and under each tick of a new day;
+// dates alone when ticks are days apart.
+export function formatAxisTimes(ticks, step) {
+  if (step >= 86400) return ticks.map((tick) => axisFormats.day.format(tick * 1000));
+  const time = step < 60 ? axisFormats.second : axisFormats.minute;
+  let day = '';
+  return ticks.map((tick) => {
+    const date = axisFormats.day.format(tick * 1000);
+    const label = time.format(tick * 1000);
+    if (date === day) return label;
+    day = date;
+    return `${label}\n${date}`;
+  });
 }

@@ -161,6 +161,7 @@ export function mount(container) {
   let utcOffset = 0;
   let markers = [];
   let version = 0;    // counts changes of the samples held
+  let updates = 0;    // updates drawn, for the measures
   let eventsAt = 0;
   let stopped = false;
   let lastCatalog = null;
@@ -275,6 +276,16 @@ export function mount(container) {
     draw();
   }
 
+  // Each update's script time, as the user-timing measure "overview-update";
+  // an hour's worth is kept.
+  function measureUpdate(started) {
+    updates += 1;
+    if (updates % 3600 === 0) performance.clearMeasures('overview-update');
+    performance.measure('overview-update', {start: started});
+    container.dataset.updates = String(updates);
+    container.dataset.series = String(store.ids.length);
+  }
+
   async function tick() {
     try {
       const answer = await catalog();
@@ -292,9 +303,12 @@ export function mount(container) {
       const since = store.newest || Math.floor(Date.now() / 1000) - reach;
       const fresh = await realtime(store.ids, since);
       if (stopped) return;
+      const started = performance.now();
       if (store.append(fresh.series)) version += 1;
       if (fresh.now && store.trim(fresh.now - reach + 1)) version += 1;
       draw();
+      await null;  // uPlot paints in a microtask queued by setData
+      measureUpdate(started);
       notice.hidden = true;
       if (Date.now() - eventsAt >= kEventMilliseconds) await loadEvents(fresh.now || store.newest);
     } catch (error) {

@@ -41,8 +41,11 @@ test('a session that ends on the server brings back the sign-in with the reason'
   await page.getByLabel('Passwort').fill('browser test password');
   await page.getByRole('button', {name: 'Anmelden'}).click();
   await page.getByRole('navigation', {name: 'Ansichten'}).waitFor();
-  await context.clearCookies();
+  // From a screen that doesn't poll, so that the next call is the click's.
   await page.getByRole('link', {name: 'Einstellungen'}).click();
+  await page.getByLabel('Echtzeitbereich').waitFor();
+  await context.clearCookies();
+  await page.getByRole('link', {name: 'Ereignisprotokoll'}).click();
   await page.getByText('Ihre Sitzung ist abgelaufen. Bitte melden Sie sich erneut an.').waitFor();
   await screenshot(page, 'signin-expired-de');
   assert.deepEqual(problems, []);

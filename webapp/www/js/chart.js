@@ -163,7 +163,7 @@ export function createChart(container, options) {
       x: {time: true, range: (u, min, max) => (window ? window : [min, max])},
       y: {range},
     },
-    axes: [{values: (u, ticks, axis, space, step) => formatAxisTimes(ticks, step)}, {values: (u, values) => values.map((v) => formatValue(v, unit)), size: 80}],
+    axes: [{space: 80, values: (u, ticks, axis, space, step) => formatAxisTimes(ticks, step)}, {values: (u, values) => values.map((v) => formatValue(v, unit)), size: 80}],
     legend: {live: true},
     cursor: {drag: {x: Boolean(onSelect), y: false, setScale: false}},
     plugins: [markerPlugin(() => markers, tooltip), thresholdPlugin(() => threshold)],

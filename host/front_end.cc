@@ -134,7 +134,7 @@ int RunFrontEnd(int control, const Options& options, const Identity* account) {
   server.set_default_headers({
       {"X-Content-Type-Options", "nosniff"},
       {"Content-Security-Policy",
-       "default-src 'none'; script-src 'self'; style-src 'self'; img-src 'self' data:; "
+       "default-src 'none'; script-src 'self'; style-src 'self'; img-src 'self'; "
        "connect-src 'self'; font-src 'self'; manifest-src 'self'; base-uri 'none'; "
        "form-action 'self'; frame-ancestors 'none'"},
       {"Referrer-Policy", "no-referrer"},

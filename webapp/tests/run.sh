@@ -13,4 +13,4 @@ node "$here/../tools/build_www.mjs" "$here/../www" "$here/../../platform/data/te
 export KOVA_WWW=$www/www
 source "$here/env.sh" "$build"
 [ $# -gt 0 ] || set -- "$here"/*.test.mjs
-node --test --test-concurrency=1 --test-reporter=spec "$@"
+node --test --test-concurrency=1 "$@"

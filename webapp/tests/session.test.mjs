@@ -1,5 +1,4 @@
-// Sign-in, sign-out and an expired session, in German and English, at desk
-// and phone width.
+// Sign-in, sign-out and an expired session, in English and German.
 
 import assert from 'node:assert/strict';
 import {after, before, test} from 'node:test';
@@ -48,6 +47,37 @@ test('a session that ends on the server brings back the sign-in with the reason'
   await page.getByRole('link', {name: 'Ereignisprotokoll'}).click();
   await page.getByText('Ihre Sitzung ist abgelaufen. Bitte melden Sie sich erneut an.').waitFor();
   await screenshot(page, 'signin-expired-de');
+  assert.deepEqual(problems, []);
+  await context.close();
+});
+
+test('a screen left while it loads stops at once; a browser clock 20 minutes fast still sees samples', async () => {
+  const {context, page, problems} = await openPage(browser, 'about:blank');
+  await page.clock.install({time: Date.now() + 20 * 60 * 1000});
+  await page.goto(system.url);
+  const polls = [];
+  page.on('request', (request) => {
+    if (request.postData()?.includes('method=realtime')) polls.push(Date.now());
+  });
+  await signIn(page);
+  const card = page.locator('[data-chart="cpu"]');
+  await page.waitForFunction(() => Number(document.querySelector('[data-chart="cpu"]')?.dataset.points) > 0);
+  // The overview comes up while the log still waits for its list.
+  await page.route('**/webapi/entry.cgi', async (route) => {
+    if (/api=KOVA.ResourceMonitor.Log&version=1&method=list/.test(route.request().postData())) {
+      await new Promise((resolve) => setTimeout(resolve, 800));
+    }
+    await route.continue();
+  });
+  await page.getByRole('link', {name: 'Event log'}).click();
+  await page.getByRole('link', {name: 'Overview'}).click();
+  await page.waitForTimeout(1500);
+  await page.getByRole('link', {name: 'Settings'}).click();
+  await page.getByLabel('Real-time range').waitFor();
+  const settled = Date.now();
+  await new Promise((resolve) => setTimeout(resolve, 2500));
+  assert.deepEqual(polls.filter((time) => time > settled + 500), []);
+  assert.equal(await card.count(), 0);
   assert.deepEqual(problems, []);
   await context.close();
 });

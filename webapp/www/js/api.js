@@ -4,8 +4,8 @@
 const kEntry = '/webapi/entry.cgi';
 
 // Host codes the app reacts to.
-export const kNotSignedIn = 106;
-export const kBadToken = 107;
+const kNotSignedIn = 106;
+const kBadToken = 107;
 
 let token = '';
 let account = '';
@@ -94,13 +94,17 @@ export async function signIn(name, password) {
   return account;
 }
 
+// Signs out. The app ends the session first, so that a poll that meets the
+// ended session on the server can't report it as expired.
 export async function signOut() {
+  const ended = token;
+  endSession('signed_out');
   try {
-    await call('KOVA.API.Auth', 'logout');
+    const body = formBody('KOVA.API.Auth', 'logout', {});
+    await fetch(kEntry, {method: 'POST', body, headers: {'X-KOVA-Token': ended}, credentials: 'same-origin'});
   } catch {
     // The session is gone either way.
   }
-  endSession('signed_out');
 }
 
 // Calls a method that answers with a file, and hands the file to the browser

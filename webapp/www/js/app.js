@@ -83,14 +83,22 @@ async function showScreen() {
     if (link.dataset.screen === screen.id) link.setAttribute('aria-current', 'page');
     else link.removeAttribute('aria-current');
   }
+  const heading = h('h2', {id: 'screen-heading', tabindex: '-1'}, t(`nav.${screen.id}`));
   const container = h('section', {class: `screen screen-${screen.id}`, 'aria-labelledby': 'screen-heading'},
-    h('h2', {id: 'screen-heading'}, t(`nav.${screen.id}`)));
+    heading);
   main.replaceChildren(container);
+  // A new screen is announced and the keyboard starts from its top.
+  heading.focus({preventScroll: true});
   try {
     const module = await screen.load();
     if (mine !== showing) return;
-    current = {id: screen.id, view: await module.mount(container)};
-    if (mine !== showing) leaveScreen();
+    const view = await module.mount(container);
+    // The user went on while this screen was being made: it goes at once.
+    if (mine !== showing) {
+      view?.unmount?.();
+      return;
+    }
+    current = {id: screen.id, view};
   } catch (error) {
     if (mine !== showing) return;
     console.debug('screen failed', error);

@@ -10,10 +10,11 @@ define({
   ger: {'chart.time': 'Zeit', 'chart.min': '{label} Min.', 'chart.max': '{label} Max.'},
 });
 
-// The colour of each event level, on charts and in the log.
-export const kLevelColors = {Info: '#2f6fba', Warning: '#d48a00', Critical: '#c62828'};
+// The colour of each event level's markers: the canvas's copy of the style
+// sheet's --info, --warning and --danger.
+const kLevelColors = {Info: '#2f6fba', Warning: '#d48a00', Critical: '#c62828'};
 
-export const kPalette = ['#1f77b4', '#e4572e', '#29a35a', '#9c4fd1', '#d4a017', '#17a2b8',
+const kPalette = ['#1f77b4', '#e4572e', '#29a35a', '#9c4fd1', '#d4a017', '#17a2b8',
                          '#8c564b', '#e377c2', '#555f6d', '#7fa31a'];
 
 const kMarkerHitPixels = 6;

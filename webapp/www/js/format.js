@@ -76,3 +76,17 @@ export function formatAxisTimes(ticks, step) {
     return `${label}\n${date}`;
   });
 }
+
+// A datetime-local input's value (the browser's zone) as Unix seconds; 0 when
+// empty or not a time.
+export function secondsOfInput(value) {
+  const seconds = Math.floor(new Date(value).getTime() / 1000);
+  return value && Number.isFinite(seconds) ? seconds : 0;
+}
+
+// Unix seconds as a datetime-local input's value, to the minute.
+export function inputOfSeconds(seconds) {
+  const date = new Date(seconds * 1000);
+  date.setMinutes(date.getMinutes() - date.getTimezoneOffset());
+  return date.toISOString().slice(0, 16);
+}

@@ -31,7 +31,6 @@ define({
     'rule.preview': 'Preview: the last 10 minutes',
     'rule.no_data': 'No data in the last 10 minutes.',
     'rule.bad_threshold': 'Enter a whole number from 0 to {max}.',
-    'rule.duplicate': 'A rule for this object, resource and severity exists already.',
   },
   ger: {
     'rule.system': 'Gesamtes System',
@@ -54,7 +53,6 @@ define({
     'rule.preview': 'Vorschau: die letzten 10 Minuten',
     'rule.no_data': 'Keine Daten in den letzten 10 Minuten.',
     'rule.bad_threshold': 'Geben Sie eine ganze Zahl von 0 bis {max} ein.',
-    'rule.duplicate': 'Eine Regel für dieses Objekt, diese Ressource und diesen Schweregrad gibt es schon.',
   },
 });
 
@@ -102,7 +100,8 @@ function measureOf(type, object, resource, series) {
   const present = (at, ids) => ids.map(at).filter((value) => value !== undefined);
   switch (resource) {
     case 1:
-      return {ids: ['cpu.idle'], value: (at) => 100 - at('cpu.idle')};
+      // Busy as the event daemon counts it: neither idle nor waiting for I/O.
+      return {ids: ['cpu.idle', 'cpu.iowait'], value: (at) => 100 - at('cpu.idle') - at('cpu.iowait')};
     case 2:
       return {ids: ['mem.used', 'mem.total'], value: (at) => percentOf(at('mem.used'), at('mem.total'))};
     case 3: {
@@ -303,7 +302,7 @@ export async function openRuleDialog(rule) {
       saved = true;
       dialog.close();
     } catch (error) {
-      note.textContent = error.code === 6106 ? t('rule.duplicate') : errorText(error);
+      note.textContent = errorText(error);
     } finally {
       save.disabled = false;
     }

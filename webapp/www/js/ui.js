@@ -1,5 +1,6 @@
 // Small DOM helpers shared by the screens.
 
+import {signedInAccount} from './api.js';
 import {define, t} from './i18n.js';
 
 define({
@@ -31,6 +32,8 @@ let statusTimer = 0;
 
 // Shows `text` in the status line for a while; errors stay until the next text.
 export function showStatus(text, {error = false} = {}) {
+  // A call that failed because the session ended has said so at the sign-in.
+  if (error && !signedInAccount()) return;
   const status = document.getElementById('status');
   clearTimeout(statusTimer);
   status.textContent = text;

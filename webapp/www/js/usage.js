@@ -9,6 +9,13 @@ const kCatalogSeconds = 10;
 
 let catalogCache = null;
 let catalogTime = 0;
+let clockSkew = 0;  // the collector's clock less the browser's, from its last answer
+
+// Unix seconds on the collector's clock, as far as its answers tell, so that a
+// browser whose clock is off still asks for the samples that exist.
+export function collectorNow() {
+  return Math.floor(Date.now() / 1000 + clockSkew);
+}
 
 // The collector's catalog, read again when older than 10 s or when `fresh`.
 export async function catalog({fresh = false} = {}) {
@@ -36,6 +43,7 @@ export async function realtime(ids, since = 0) {
     now = Math.max(now, answer.now ?? 0);
     for (const one of answer.series) series.set(one.id, one);
   }
+  if (now > 0) clockSkew = now - Date.now() / 1000;
   return {now, series};
 }
 

@@ -5,7 +5,7 @@
 
 import {createChart} from '../chart.js';
 import {errorText} from '../errors.js';
-import {formatTime} from '../format.js';
+import {formatTime, inputOfSeconds, secondsOfInput} from '../format.js';
 import {complement, joinSeries, sumSeries} from '../history-data.js';
 import {define, t} from '../i18n.js';
 import {h, startPolling} from '../ui.js';
@@ -23,9 +23,10 @@ define({
     'history.to': 'To',
     'history.apply': 'Show',
     'history.bad_range': 'Enter a start that comes before the end.',
+    'history.short_range': 'Choose a range of at least {seconds} seconds.',
     'history.zoom_out': 'Zoom out',
     'history.zoom_reset': 'Reset zoom',
-    'history.hint': 'Drag across a chart to zoom in.',
+    'history.hint': 'Drag across a chart to zoom in, or type a range under {custom}.',
     'history.caption': '{from} – {to} · history in steps of {step}',
     'history.empty': '{from} – {to} · no usage was recorded in this time.',
     'history.loading': 'Loading…',
@@ -63,9 +64,10 @@ define({
     'history.to': 'Bis',
     'history.apply': 'Anzeigen',
     'history.bad_range': 'Geben Sie einen Beginn vor dem Ende ein.',
+    'history.short_range': 'Wählen Sie einen Bereich von mindestens {seconds} Sekunden.',
     'history.zoom_out': 'Herauszoomen',
     'history.zoom_reset': 'Zoom zurücksetzen',
-    'history.hint': 'Ziehen Sie über ein Diagramm, um hineinzuzoomen.',
+    'history.hint': 'Ziehen Sie über ein Diagramm, um hineinzuzoomen, oder geben Sie unter {custom} einen Bereich ein.',
     'history.caption': '{from} – {to} · Verlauf in Schritten von {step}',
     'history.empty': '{from} – {to} · in dieser Zeit wurde keine Nutzung aufgezeichnet.',
     'history.loading': 'Wird geladen …',
@@ -117,13 +119,6 @@ function troubleOf(error) {
   return {6201: 'collector', 6202: 'off', 6203: 'database'}[error?.code] ?? 'failed';
 }
 
-// Unix seconds as the value of a datetime-local input, in local time.
-function inputValue(seconds) {
-  const date = new Date(seconds * 1000);
-  date.setMinutes(date.getMinutes() - date.getTimezoneOffset());
-  return date.toISOString().slice(0, 16);
-}
-
 // A step of the history: whole minutes or whole hours.
 function stepText(seconds) {
   return seconds % 3600 === 0 ? `${seconds / 3600} h` : `${Math.round(seconds / 60)} min`;
@@ -163,7 +158,7 @@ export function mount(container) {
       rangeButtons, customButton),
     customForm,
     h('div', {class: 'history-where'},
-      h('div', {}, caption, h('p', {class: 'muted'}, t('history.hint'))), zoomBar));
+      h('div', {}, caption, h('p', {class: 'muted'}, t('history.hint', {custom: t('history.range.custom')}))), zoomBar));
   const notice = h('div', {class: 'notice history-notice', role: 'alert', hidden: true});
   const grid = h('div', {class: 'grid history-charts', hidden: true});
   const loading = h('p', {class: 'muted'}, t('history.loading'));
@@ -343,18 +338,22 @@ export function mount(container) {
     customButton.setAttribute('aria-expanded', String(!customForm.hidden));
     if (customForm.hidden) return;
     if (shown) {
-      fromInput.value = inputValue(shown.from);
-      toInput.value = inputValue(shown.to);
+      fromInput.value = inputOfSeconds(shown.from);
+      toInput.value = inputOfSeconds(shown.to);
     }
     fromInput.focus();
   }
 
   function applyCustom(event) {
     event.preventDefault();
-    const from = Math.floor(new Date(fromInput.value).getTime() / 1000);
-    const to = Math.ceil(new Date(toInput.value).getTime() / 1000);
-    if (!(from >= 0 && to - from >= kMinSpan)) {
+    const from = secondsOfInput(fromInput.value);
+    const to = secondsOfInput(toInput.value);
+    if (!(from > 0 && to > from)) {
       customNote.textContent = t('history.bad_range');
+      return;
+    }
+    if (to - from < kMinSpan) {
+      customNote.textContent = t('history.short_range', {seconds: kMinSpan});
       return;
     }
     customNote.textContent = '';

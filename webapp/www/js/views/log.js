@@ -3,7 +3,7 @@
 
 import {call, download} from '../api.js';
 import {errorText} from '../errors.js';
-import {formatTime} from '../format.js';
+import {formatTime, secondsOfInput} from '../format.js';
 import {define, t} from '../i18n.js';
 import {confirmDialog, h, showStatus} from '../ui.js';
 import {catalog, logTimeToSeconds} from '../usage.js';
@@ -68,15 +68,6 @@ define({
 const kLog = 'KOVA.ResourceMonitor.Log';
 const kPageSize = 25;
 
-// A datetime-local value as Unix seconds in the browser's zone; 0 when empty.
-// A bound given to the minute takes in that whole minute when it is the end.
-function inputSeconds(value, end) {
-  if (!value) return 0;
-  const seconds = Math.floor(new Date(value).getTime() / 1000);
-  if (!Number.isFinite(seconds)) return 0;
-  return end && value.length === 16 ? seconds + 59 : seconds;
-}
-
 function levelName(level) {
   const key = `log.level_${level}`;
   return t(key) === key ? level : t(key);
@@ -136,8 +127,8 @@ export async function mount(container) {
   function filter() {
     const chosen = {};
     if (level.value) chosen.loglevel = level.value;
-    const datefrom = inputSeconds(from.value, false);
-    const dateto = inputSeconds(to.value, true);
+    const datefrom = secondsOfInput(from.value);
+    const dateto = secondsOfInput(to.value);
     if (datefrom) chosen.datefrom = datefrom;
     if (dateto) chosen.dateto = dateto;
     if (keyword.value.trim()) chosen.keyword = keyword.value.trim();

@@ -8,7 +8,7 @@ import {errorText} from '../errors.js';
 import {define, t} from '../i18n.js';
 import {LiveStore} from '../live.js';
 import {h, startPolling} from '../ui.js';
-import {catalog, events, realtime} from '../usage.js';
+import {catalog, collectorNow, events, realtime} from '../usage.js';
 
 define({
   enu: {
@@ -300,7 +300,7 @@ export function mount(container) {
         store.fill(past.series);
         version += 1;
       }
-      const since = store.newest || Math.floor(Date.now() / 1000) - reach;
+      const since = store.newest || collectorNow() - reach;
       const fresh = await realtime(store.ids, since);
       if (stopped) return;
       const started = performance.now();

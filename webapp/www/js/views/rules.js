@@ -73,13 +73,14 @@ export async function mount(container) {
     h('button', {type: 'button', onclick: () => switchRules([...selected], false)}, t('rules.switch_off')),
     h('button', {type: 'button', class: 'danger', onclick: deleteSelected}, t('rules.delete')),
   ];
+  const newButton = h('button', {type: 'button', class: 'primary', onclick: () => edit(null)}, t('rules.new'));
   const note = h('p', {class: 'error', role: 'alert'});
   const body = h('tbody');
   const column = (key) => h('th', {scope: 'col'}, t(key));
   const hidden = (key) => h('th', {scope: 'col'}, h('span', {class: 'rules-hidden'}, t(key)));
   container.append(
     h('div', {class: 'toolbar rules-toolbar'},
-      h('button', {type: 'button', class: 'primary', onclick: () => edit(null)}, t('rules.new')),
+      newButton,
       h('div', {class: 'rules-bulk'},
         h('label', {class: 'rules-all'}, all, ` ${t('rules.select_all')}`), count, bulk)),
     note,
@@ -174,6 +175,8 @@ export async function mount(container) {
       showStatus(errorText(error), {error: true});
     }
     await load();
+    // The rows and the focused Delete are gone or disabled; the keyboard goes on from here.
+    if (!left) newButton.focus();
   }
 
   // Opens the dialog for the rule `id`, read afresh, or for a new rule.

@@ -6,7 +6,7 @@ import {errorText} from '../errors.js';
 import {formatValue} from '../format.js';
 import {define, locale, t} from '../i18n.js';
 import {h, startPolling} from '../ui.js';
-import {catalog, realtime} from '../usage.js';
+import {catalog, collectorNow, realtime} from '../usage.js';
 
 define({
   enu: {
@@ -119,7 +119,7 @@ export function mount(container) {
       const ids = know((await catalog()).series ?? []);
       if (stopped) return;
       if (ids.length) {
-        const answer = await realtime(ids, since || Math.floor(Date.now() / 1000) - 60);
+        const answer = await realtime(ids, since || collectorNow() - 60);
         if (stopped) return;
         for (const [id, one] of answer.series) {
           const [name, key] = columns.get(id) ?? [];

@@ -7,6 +7,7 @@ import {call} from '../api.js';
 import {errorText} from '../errors.js';
 import {define, t} from '../i18n.js';
 import {h, showStatus} from '../ui.js';
+import {catalog} from '../usage.js';
 
 define({
   enu: {
@@ -92,6 +93,8 @@ export async function mount(container) {
     event.checked = answer.enable_event;
     apply.disabled = true;
     fields.disabled = false;
+    // Disabling the form took the focus from Apply; it goes back to the form.
+    if (!gone && document.activeElement === document.body) (apply.disabled ? fields.querySelector('select') : apply)?.focus();
   }
 
   async function submit(submitted) {
@@ -105,6 +108,8 @@ export async function mount(container) {
     try {
       await call(kSetting, 'set', changed);
       if (!gone) showStatus(t('settings.saved'));
+      // The charts take the new reach from the catalog at once.
+      catalog({fresh: true}).catch(() => {});
     } catch (error) {
       failure = error;
     }
@@ -118,6 +123,8 @@ export async function mount(container) {
       apply.disabled = !Object.keys(changes()).length;
     }
     fields.disabled = false;
+    // Disabling the form took the focus from Apply; it goes back to the form.
+    if (!gone && document.activeElement === document.body) (apply.disabled ? fields.querySelector('select') : apply)?.focus();
   }
 
   try {

@@ -83,8 +83,31 @@ export async function startSystem({settings = {}, perfeventTimeScale = 0.1, stat
     log += chunk;
     writeFileSync(hostLog, log);
   });
-  const port = await waitFor(() => /listening on http:\/\/127\.0\.0\.1:(\d+)\//.exec(log)?.[1],
-                             `kova-webapid to listen\n${log}`);
+  // Stops everything started and removes the root.
+  async function stop() {
+    host.kill('SIGTERM');
+    await new Promise((resolve) => {
+      if (host.exitCode !== null || host.signalCode !== null) resolve();
+      host.once('exit', resolve).once('error', resolve);
+    });
+    for (const service of ['kovaperfeventd', 'kovastatd', ...(database ? ['pgsql'] : [])]) {
+      try {
+        kova(['service', 'stop', service]);
+      } catch {
+        // Not running.
+      }
+    }
+    rmSync(root, {recursive: true, force: true});
+  }
+  let port;
+  try {
+    port = await waitFor(() => /listening on http:\/\/127\.0\.0\.1:(\d+)\//.exec(log)?.[1],
+                         'kova-webapid to listen');
+  } catch (error) {
+    error.message += `\n${log}`;
+    await stop();  // a start that fails leaves no daemon behind
+    throw error;
+  }
   const url = `http://127.0.0.1:${port}/`;
 
   return {
@@ -99,18 +122,7 @@ export async function startSystem({settings = {}, perfeventTimeScale = 0.1, stat
         return '';
       }
     },
-    async stop() {
-      host.kill('SIGTERM');
-      await new Promise((resolve) => (host.exitCode !== null ? resolve() : host.once('exit', resolve)));
-      for (const service of ['kovaperfeventd', 'kovastatd', ...(database ? ['pgsql'] : [])]) {
-        try {
-          kova(['service', 'stop', service]);
-        } catch {
-          // Not running.
-        }
-      }
-      rmSync(root, {recursive: true, force: true});
-    },
+    stop,
   };
 }
 

@@ -8,7 +8,7 @@ import assert from 'node:assert/strict';
 import {spawn} from 'node:child_process';
 import {after, before, test} from 'node:test';
 import {LiveStore} from '../www/js/live.js';
-import {kAccount, kPassword, launchBrowser, openPage, screenshot, signIn, startSystem, waitFor} from './system.mjs';
+import {apiSession, launchBrowser, openPage, screenshot, signIn, startSystem, waitFor} from './system.mjs';
 
 let system;
 let browser;
@@ -20,19 +20,6 @@ after(async () => {
   await browser?.close();
   await system?.stop();
 });
-
-// Calls the web API with a session of its own, as a script would.
-async function apiSession() {
-  const post = async (params) => {
-    const reply = await fetch(`${system.url}webapi/entry.cgi`, {method: 'POST', body: new URLSearchParams(params)});
-    const answer = await reply.json();
-    assert.equal(answer.success, true, JSON.stringify(answer));
-    return answer.data;
-  };
-  const {sid} = await post({api: 'KOVA.API.Auth', version: '1', method: 'login', account: kAccount, password: kPassword});
-  return (api, method, params = {}) => post({api, version: '1', method, _sid: sid,
-    ...Object.fromEntries(Object.entries(params).map(([name, value]) => [name, JSON.stringify(value)]))});
-}
 
 const points = async (page, key) => Number(await page.locator(`[data-chart="${key}"]`).getAttribute('data-points'));
 
@@ -65,7 +52,7 @@ test('the store lines series up on one time axis, trims in place and fills serie
 });
 
 test('charts open with the window held, gain points, show each core, fit a phone and outlive the collector', async () => {
-  const call = await apiSession();
+  const call = await apiSession(system);
   // Rates join the catalog from the collector's second pass on.
   const {series} = await waitFor(async () => {
     const answer = await call('KOVA.ResourceMonitor.Usage', 'catalog');
@@ -117,7 +104,7 @@ test('charts open with the window held, gain points, show each core, fit a phone
 });
 
 test('a CPU event of the event daemon is drawn on every chart with its text, and logged', async () => {
-  const call = await apiSession();
+  const call = await apiSession(system);
   await call('KOVA.ResourceMonitor.EventRule', 'set',
              {type: 0, service: '', resource: 1, severity: 1, threshold: 1, enable: true});
   await call('KOVA.ResourceMonitor.Setting', 'set', {enable_event: true});

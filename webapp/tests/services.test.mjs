@@ -6,7 +6,7 @@ import assert from 'node:assert/strict';
 import {writeFileSync} from 'node:fs';
 import {join} from 'node:path';
 import {after, before, test} from 'node:test';
-import {kAccount, kPassword, launchBrowser, openPage, screenshot, signIn, startSystem, waitFor} from './system.mjs';
+import {apiSession, launchBrowser, openPage, screenshot, signIn, startSystem, waitFor} from './system.mjs';
 
 // A service that burns a CPU and ten that sleep: twelve with kovastatd. By
 // name alone, the burner would come after the sleepers.
@@ -24,10 +24,8 @@ before(async () => {
   }
   browser = await launchBrowser();
   // A service's CPU joins the catalog from the collector's second pass after its start.
-  const post = async (params) => (await (await fetch(`${system.url}webapi/entry.cgi`,
-                                                     {method: 'POST', body: new URLSearchParams(params)})).json()).data;
-  const {sid} = await post({api: 'KOVA.API.Auth', version: '1', method: 'login', account: kAccount, password: kPassword});
-  await waitFor(async () => (await post({api: 'KOVA.ResourceMonitor.Usage', version: '1', method: 'catalog', _sid: sid}))
+  const call = await apiSession(system);
+  await waitFor(async () => (await call('KOVA.ResourceMonitor.Usage', 'catalog'))
     .series.some((one) => one.id === 'service.cpu@burner'), 'the burner in the catalog');
 });
 after(async () => {

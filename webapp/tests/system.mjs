@@ -126,6 +126,21 @@ export async function startSystem({settings = {}, perfeventTimeScale = 0.1, stat
   };
 }
 
+// Signs in to the web API of `system` as a script would; returns
+// call(api, method, params) that sends each value as JSON and resolves to the
+// answer's data, or throws with the answer.
+export async function apiSession(system) {
+  const post = async (params) => {
+    const reply = await fetch(`${system.url}webapi/entry.cgi`, {method: 'POST', body: new URLSearchParams(params)});
+    const answer = await reply.json();
+    if (answer.success !== true) throw new Error(`${params.api} ${params.method}: ${JSON.stringify(answer)}`);
+    return answer.data;
+  };
+  const {sid} = await post({api: 'KOVA.API.Auth', version: '1', method: 'login', account: kAccount, password: kPassword});
+  return (api, method, params = {}) => post({api, version: '1', method, _sid: sid,
+    ...Object.fromEntries(Object.entries(params).map(([name, value]) => [name, JSON.stringify(value)]))});
+}
+
 // Debian's chromium, headless, with nothing that reaches out to the network.
 export async function launchBrowser() {
   return chromium.launch({

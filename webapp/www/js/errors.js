@@ -2,6 +2,7 @@
 // string tables ("err_session", "err_key"); the others are the app's own, by
 // code.
 
+import {ApiError} from './api.js';
 import {define, systemText, t} from './i18n.js';
 
 define({
@@ -60,4 +61,15 @@ export function errorText(error) {
   const key = `error.${code}`;
   const text = t(key, {seconds: errors?.retry_after ?? '', code});
   return text === key ? t('error.other', {code}) : text;
+}
+
+// Shows the words for a failed call in `notice`. Anything but an ApiError is
+// a fault of the page itself, for the console.
+export function showCallError(notice, error) {
+  if (!(error instanceof ApiError)) {
+    console.error(error);
+    return;
+  }
+  notice.textContent = errorText(error);
+  notice.hidden = false;
 }

@@ -4,7 +4,7 @@
 
 import {ApiError} from '../api.js';
 import {createChart} from '../chart.js';
-import {errorText} from '../errors.js';
+import {showCallError} from '../errors.js';
 import {define, t} from '../i18n.js';
 import {LiveStore} from '../live.js';
 import {h, startPolling} from '../ui.js';
@@ -312,13 +312,7 @@ export function mount(container) {
       notice.hidden = true;
       if (Date.now() - eventsAt >= kEventMilliseconds) await loadEvents(fresh.now || store.newest);
     } catch (error) {
-      if (stopped) return;
-      if (!(error instanceof ApiError)) {
-        console.error(error);
-        return;
-      }
-      notice.textContent = errorText(error);
-      notice.hidden = false;
+      if (!stopped) showCallError(notice, error);
     }
   }
 

@@ -1,8 +1,7 @@
 // The services screen: the services and packages that use the most CPU or
 // memory now, by the newest sample of each, updated every second.
 
-import {ApiError} from '../api.js';
-import {errorText} from '../errors.js';
+import {showCallError} from '../errors.js';
 import {formatValue} from '../format.js';
 import {define, locale, t} from '../i18n.js';
 import {h, startPolling} from '../ui.js';
@@ -134,13 +133,7 @@ export function mount(container) {
       notice.hidden = true;
       render();
     } catch (error) {
-      if (stopped) return;
-      if (!(error instanceof ApiError)) {
-        console.error(error);
-        return;
-      }
-      notice.textContent = errorText(error);
-      notice.hidden = false;
+      if (!stopped) showCallError(notice, error);
     }
   }
 

@@ -64,8 +64,7 @@ void SessionStore::Remove(const std::string& sid) {
   sessions_.erase(sid);
 }
 
-int LoginThrottle::WaitSeconds(const std::vector<std::string>& keys, TimePoint now) {
-  std::lock_guard lock(mutex_);
+long long LoginThrottle::WaitLocked(const std::vector<std::string>& keys, TimePoint now) const {
   long long wait = 0;
   for (const std::string& key : keys) {
     auto it = records_.find(key);
@@ -77,16 +76,26 @@ int LoginThrottle::WaitSeconds(const std::vector<std::string>& keys, TimePoint n
         std::chrono::ceil<std::chrono::seconds>(it->second.last + delay - now).count();
     wait = std::max<long long>(wait, left);
   }
-  return static_cast<int>(wait);
+  return wait;
 }
 
-void LoginThrottle::Failed(const std::vector<std::string>& keys, TimePoint now) {
+int LoginThrottle::Reserve(const std::vector<std::string>& keys, TimePoint now) {
   std::lock_guard lock(mutex_);
+  if (const long long wait = WaitLocked(keys, now); wait > 0) return static_cast<int>(wait);
   Forget(now);
   for (const std::string& key : keys) {
     Record& record = records_[key];
     ++record.failures;
     record.last = now;
+  }
+  return 0;
+}
+
+void LoginThrottle::Cancel(const std::vector<std::string>& keys) {
+  std::lock_guard lock(mutex_);
+  for (const std::string& key : keys) {
+    auto it = records_.find(key);
+    if (it != records_.end() && --it->second.failures <= 0) records_.erase(it);
   }
 }
 

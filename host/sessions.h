@@ -57,10 +57,15 @@ class LoginThrottle {
   static constexpr int kFreeFailures = 5;
   static constexpr std::chrono::seconds kMaxWait{300};
 
-  // Seconds to wait before the next attempt for any of `keys`, 0 when one may try now.
-  int WaitSeconds(const std::vector<std::string>& keys, TimePoint now);
-  void Failed(const std::vector<std::string>& keys, TimePoint now);
+  // Reserves a sign-in attempt for `keys` at `now`: returns 0 and counts the
+  // attempt as failed until Succeeded or Cancel says otherwise, or returns the
+  // seconds to wait when any key must wait first, counting nothing. Checking and
+  // counting under one lock keeps attempts sent at once from passing together.
+  int Reserve(const std::vector<std::string>& keys, TimePoint now);
+  // The reserved attempt succeeded: the keys start afresh.
   void Succeeded(const std::vector<std::string>& keys);
+  // The reserved attempt checked no password (the accounts could not be read).
+  void Cancel(const std::vector<std::string>& keys);
 
  private:
   struct Record {
@@ -68,6 +73,7 @@ class LoginThrottle {
     TimePoint last;
   };
   static constexpr size_t kCapacity = 10000;
+  long long WaitLocked(const std::vector<std::string>& keys, TimePoint now) const;
   void Forget(TimePoint now);
 
   std::mutex mutex_;

@@ -2,6 +2,9 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <thread>
+
 namespace kova_host {
 namespace {
 
@@ -37,20 +40,38 @@ TEST(SessionsTest, RepeatedFailuresWaitLongerAndLonger) {
   LoginThrottle throttle;
   const TimePoint start{};
   const std::vector<std::string> keys = {"account:admin", "address:127.0.0.1"};
-  for (int i = 0; i < LoginThrottle::kFreeFailures; ++i) {
-    EXPECT_EQ(throttle.WaitSeconds(keys, start), 0) << i;
-    throttle.Failed(keys, start);
-  }
-  EXPECT_EQ(throttle.WaitSeconds(keys, start), 1);
-  EXPECT_EQ(throttle.WaitSeconds({"address:127.0.0.1"}, start), 1);  // either key counts
-  EXPECT_EQ(throttle.WaitSeconds({"account:other"}, start), 0);
-  EXPECT_EQ(throttle.WaitSeconds(keys, start + milliseconds(1001)), 0);
-  throttle.Failed(keys, start + seconds(2));
-  EXPECT_EQ(throttle.WaitSeconds(keys, start + seconds(2)), 2);
-  for (int i = 0; i < 20; ++i) throttle.Failed(keys, start + seconds(3));
-  EXPECT_EQ(throttle.WaitSeconds(keys, start + seconds(3)), LoginThrottle::kMaxWait.count());
+  for (int i = 0; i < LoginThrottle::kFreeFailures; ++i)
+    EXPECT_EQ(throttle.Reserve(keys, start), 0) << i;
+  EXPECT_EQ(throttle.Reserve(keys, start), 1);
+  EXPECT_EQ(throttle.Reserve({"address:127.0.0.1"}, start), 1);  // either key counts
+  EXPECT_EQ(throttle.Reserve({"account:other"}, start), 0);
+  EXPECT_EQ(throttle.Reserve(keys, start + milliseconds(1001)), 0);
+  EXPECT_EQ(throttle.Reserve(keys, start + milliseconds(1001)), 2);
+  // An attempt that checked no password doesn't count.
+  EXPECT_EQ(throttle.Reserve(keys, start + seconds(4)), 0);
+  throttle.Cancel(keys);
+  EXPECT_EQ(throttle.Reserve(keys, start + seconds(4)), 2);
+  for (int i = 0; i < 20; ++i) throttle.Reserve(keys, start + seconds(1000 * (i + 1)));
+  EXPECT_EQ(throttle.Reserve(keys, start + seconds(20000)), LoginThrottle::kMaxWait.count());
   throttle.Succeeded(keys);
-  EXPECT_EQ(throttle.WaitSeconds(keys, start + seconds(3)), 0);
+  EXPECT_EQ(throttle.Reserve(keys, start + seconds(20000)), 0);
+}
+
+// Attempts sent at once get no more password checks than one after another.
+TEST(SessionsTest, AttemptsAtOnceAreCountedOneByOne) {
+  LoginThrottle throttle;
+  const TimePoint start{};
+  const std::vector<std::string> keys = {"account:admin", "address:127.0.0.1"};
+  for (const auto& [at, allowed] :
+       {std::pair{start, LoginThrottle::kFreeFailures}, std::pair{start + milliseconds(1001), 1}}) {
+    std::atomic<int> passed = 0;
+    std::vector<std::thread> threads;
+    for (int i = 0; i < 32; ++i) {
+      threads.emplace_back([&, at = at] { passed += throttle.Reserve(keys, at) == 0; });
+    }
+    for (std::thread& thread : threads) thread.join();
+    EXPECT_EQ(passed, allowed);
+  }
 }
 
 }  // namespace

@@ -193,7 +193,7 @@ EntryReply WebEntry::SignIn(const EntryRequest& request, const Call& call) {
   CurrentAccess().user = *account;
   const std::vector<std::string> keys = {"account:" + *account, "address:" + request.remote_addr};
   const TimePoint now = std::chrono::steady_clock::now();
-  if (const int wait = throttle_.WaitSeconds(keys, now); wait > 0) {
+  if (const int wait = throttle_.Reserve(keys, now); wait > 0) {
     Json::Value errors;
     errors["reason"] = "too many failed sign-ins; try again later";
     errors["retry_after"] = wait;
@@ -203,11 +203,12 @@ EntryReply WebEntry::SignIn(const EntryRequest& request, const Call& call) {
   }
   bool admin = false;
   const int checked = check_password_(*account, *password, admin);
-  if (checked < 0) return Error(KOVA::kAPIErrorUnknown, "the accounts can't be read");
-  if (checked == 0) {
-    throttle_.Failed(keys, std::chrono::steady_clock::now());
-    return Error(kErrorSignInFailed, "wrong account name or password");
+  if (checked < 0) {
+    throttle_.Cancel(keys);
+    return Error(KOVA::kAPIErrorUnknown, "the accounts can't be read");
   }
+  // A wrong password was counted when the attempt was reserved.
+  if (checked == 0) return Error(kErrorSignInFailed, "wrong account name or password");
   throttle_.Succeeded(keys);
   Session session;
   const std::string sid =

@@ -18,10 +18,11 @@ inline constexpr size_t kMaxFrame = size_t{256} << 20;
 
 enum class IoResult {
   kOk,
-  kClosed,    // the other side closed the socket (or died)
-  kTimeout,   // the deadline passed
-  kTooLarge,  // a frame longer than allowed
-  kError,     // any other failure (errno says which)
+  kClosed,     // the other side closed the socket (or died)
+  kTimeout,    // the deadline passed
+  kTooLarge,   // a frame longer than allowed
+  kMalformed,  // a whole frame that doesn't hold the message expected
+  kError,      // any other failure (errno says which)
 };
 
 IoResult WriteFrame(int fd, std::string_view payload, Clock::time_point deadline);

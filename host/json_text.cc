@@ -3,6 +3,7 @@
 #include <json/reader.h>
 #include <json/writer.h>
 
+#include <map>
 #include <memory>
 #include <sstream>
 
@@ -22,21 +23,30 @@ std::string ToJson(const Json::Value& value) {
   return out.str();
 }
 
-bool FromJson(std::string_view text, Json::Value& value) {
-  thread_local const std::unique_ptr<Json::CharReader> reader = [] {
+JsonParse ParseJsonText(std::string_view text, Json::Value& value, int max_depth) {
+  // One reader per depth and thread: making one is dear, and readers aren't shared.
+  thread_local std::map<int, std::unique_ptr<Json::CharReader>> readers;
+  std::unique_ptr<Json::CharReader>& reader = readers[max_depth];
+  if (!reader) {
     Json::CharReaderBuilder builder;
     Json::CharReaderBuilder::strictMode(&builder.settings_);
     builder["strictRoot"] = false;
-    builder["stackLimit"] = 64;
-    return std::unique_ptr<Json::CharReader>(builder.newCharReader());
-  }();
-  if (text.empty()) return false;
+    builder["stackLimit"] = max_depth;
+    reader.reset(builder.newCharReader());
+  }
+  if (text.empty()) return JsonParse::kNotJson;
   std::string errors;
   try {
-    return reader->parse(text.data(), text.data() + text.size(), &value, &errors);
+    return reader->parse(text.data(), text.data() + text.size(), &value, &errors)
+               ? JsonParse::kOk
+               : JsonParse::kNotJson;
   } catch (const Json::Exception&) {  // nested deeper than the limit
-    return false;
+    return JsonParse::kTooDeep;
   }
+}
+
+bool FromJson(std::string_view text, Json::Value& value) {
+  return ParseJsonText(text, value, kMaxJsonDepth) == JsonParse::kOk;
 }
 
 Json::Value SuccessEnvelope(const Json::Value& data) {

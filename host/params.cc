@@ -55,9 +55,16 @@ bool DecodeForm(std::string_view text, FormFields& fields, std::string& error) {
   return true;
 }
 
-Json::Value ParamValue(const std::string& text) {
-  Json::Value value;
-  return FromJson(text, value) ? value : Json::Value(text);
+bool ParamValue(const std::string& text, Json::Value& value) {
+  switch (ParseJsonText(text, value, kMaxParamDepth)) {
+    case JsonParse::kOk:
+      return true;
+    case JsonParse::kNotJson:
+      value = text;
+      return true;
+    default:
+      return false;
+  }
 }
 
 }  // namespace kova_host

@@ -22,7 +22,8 @@ bool DecodeForm(std::string_view text, FormFields& fields, std::string& error);
 
 // The value of a parameter: its JSON value when the whole text is valid JSON
 // ("10", "true", "[\"a\"]", "{\"k\": 1}"), the text itself otherwise ("csv").
-Json::Value ParamValue(const std::string& text);
+// False for JSON nested deeper than kMaxParamDepth, which no call may carry.
+bool ParamValue(const std::string& text, Json::Value& value);
 
 }  // namespace kova_host
 

@@ -55,10 +55,18 @@ TEST(ParamsTest, TakesJsonWhenTheWholeTextIsJson) {
   for (const auto& c : cases) {
     Json::Value expected;
     ASSERT_TRUE(FromJson(c.value, expected)) << c.value;
-    EXPECT_EQ(ParamValue(c.text), expected) << c.text;
+    Json::Value value;
+    ASSERT_TRUE(ParamValue(c.text, value)) << c.text;
+    EXPECT_EQ(value, expected) << c.text;
   }
-  std::string deep(100, '[');
-  EXPECT_TRUE(ParamValue(deep + std::string(100, ']')).isString());  // too deep for JSON
+  // Nesting up to the limit is taken; deeper is refused, not read as text.
+  const auto nested = [](int depth) {
+    return std::string(depth, '[') + "1" + std::string(depth, ']');
+  };
+  Json::Value value;
+  EXPECT_TRUE(ParamValue(nested(kMaxParamDepth - 1), value) && value.isArray());
+  EXPECT_FALSE(ParamValue(nested(kMaxParamDepth + 1), value));
+  EXPECT_FALSE(ParamValue(nested(100), value));
 }
 
 }  // namespace

@@ -131,8 +131,16 @@ int RunRunner(int fd, const RunnerSetup& setup) {
     RunnerCall call;
     const IoResult got = ReceiveCall(reader, call);
     if (got == IoResult::kClosed) return 0;
+    if (got == IoResult::kMalformed) {
+      // The frame was read whole, so the runner answers it and takes the next.
+      HostLog("runner: refused a malformed call from the front-end");
+      Json::Value errors;
+      errors["reason"] = "the host could not read the call";
+      if (SendAnswer(fd, Error(KOVA::kAPIErrorBadParameter, errors)) != IoResult::kOk) return 1;
+      continue;
+    }
     if (got != IoResult::kOk) {
-      HostLog("runner: malformed call from the front-end");
+      HostLog("runner: unreadable call from the front-end");
       return 1;
     }
     const RunnerAnswer answer = ExecuteCall(call);

@@ -5,13 +5,15 @@
 namespace kova_host {
 namespace {
 
-constexpr size_t kMaxMessage = size_t{2} << 20;  // a call carries at most a 1 MiB body
+// A call carries at most a 1 MiB body and a query; escaped as JSON, a control
+// byte takes six ("\u0001"), so 8 MiB holds any call the front-end takes.
+constexpr size_t kMaxMessage = size_t{8} << 20;
 
 IoResult ReadJson(FrameReader& reader, Json::Value& value, Clock::time_point deadline) {
   std::string text;
   const IoResult got = reader.Read(text, kMaxMessage, deadline);
   if (got != IoResult::kOk) return got;
-  return FromJson(text, value) && value.isObject() ? IoResult::kOk : IoResult::kError;
+  return FromJson(text, value) && value.isObject() ? IoResult::kOk : IoResult::kMalformed;
 }
 
 bool IsText(const Json::Value& value) { return value.isString(); }
@@ -55,7 +57,7 @@ IoResult ReceiveCall(FrameReader& reader, RunnerCall& call) {
   if (got != IoResult::kOk) return got;
   if (!IsText(message["api"]) || !message["version"].isInt() || !IsText(message["method"]) ||
       !message["params"].isObject() || !IsText(message["user"]) || !IsText(message["language"])) {
-    return IoResult::kError;
+    return IoResult::kMalformed;
   }
   call = {message["api"].asString(), message["version"].asInt(), message["method"].asString(),
           message["params"],         message["user"].asString(), message["language"].asString()};

@@ -38,7 +38,8 @@ IoResult ReceiveReady(FrameReader& reader, Json::Value& methods, Clock::time_poi
 // The frame's payload of a call, as SendCall writes it.
 std::string EncodeCall(const RunnerCall& call);
 IoResult SendCall(int fd, const RunnerCall& call, Clock::time_point deadline);
-// kError also for a frame that isn't a well-formed call.
+// kMalformed for a whole frame that isn't a well-formed call; the next frame
+// can still be read.
 IoResult ReceiveCall(FrameReader& reader, RunnerCall& call);
 
 IoResult SendAnswer(int fd, const RunnerAnswer& answer);

@@ -7,6 +7,7 @@
 #include <thread>
 
 #include "host/json_text.h"
+#include "host/params.h"
 
 namespace kova_host {
 namespace {
@@ -56,9 +57,21 @@ TEST_F(RunnerProtocolTest, ReportsTimeoutsClosedPeersAndMalformedFrames) {
 
   ASSERT_EQ(WriteFrame(fds_[1], R"({"api": "x"})", kNoDeadline), IoResult::kOk);
   RunnerCall call;
-  EXPECT_EQ(ReceiveCall(reader_[0], call), IoResult::kError);  // not a whole call
+  EXPECT_EQ(ReceiveCall(reader_[0], call), IoResult::kMalformed);  // not a whole call
   ASSERT_EQ(WriteFrame(fds_[1], "not json", kNoDeadline), IoResult::kOk);
-  EXPECT_EQ(ReceiveCall(reader_[0], call), IoResult::kError);
+  EXPECT_EQ(ReceiveCall(reader_[0], call), IoResult::kMalformed);
+  // Calls nested to the parameters' limit, or a 1 MiB body of control bytes
+  // escaped sixfold, still come through whole.
+  const std::string deep =
+      std::string(kMaxParamDepth - 1, '[') + "1" + std::string(kMaxParamDepth - 1, ']');
+  Json::Value params;
+  ASSERT_TRUE(ParamValue(deep, params["x"]));
+  ASSERT_TRUE(ParamValue(std::string(1 << 20, '\x01'), params["y"]));
+  const RunnerCall big{"KOVA.Test", 1, "echo", params, "admin", "enu"};
+  std::thread sender([&] { EXPECT_EQ(SendCall(fds_[1], big, kNoDeadline), IoResult::kOk); });
+  EXPECT_EQ(ReceiveCall(reader_[0], call), IoResult::kOk);
+  sender.join();
+  EXPECT_EQ(call.params, params);
 
   const char huge[4] = {'\x7f', '\x00', '\x00', '\x00'};  // 2 GiB announced
   ASSERT_EQ(write(fds_[1], huge, sizeof(huge)), 4);

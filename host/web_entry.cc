@@ -291,7 +291,11 @@ EntryReply WebEntry::RunModule(const EntryRequest& request, const Call& call) {
                          call.method,     Json::Value(Json::objectValue),
                          session.account, session.language};
   for (const auto& [name, text] : call.fields) {
-    if (kHostParams.count(name) == 0) runner_call.params[name] = ParamValue(text);
+    if (kHostParams.count(name) != 0) continue;
+    if (!ParamValue(text, runner_call.params[name])) {
+      return Error(KOVA::kAPIErrorBadParameter,
+                   "parameter " + name + " nests deeper than " + std::to_string(kMaxParamDepth));
+    }
   }
   RunnerAnswer answer;
   std::string error;

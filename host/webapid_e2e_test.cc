@@ -443,6 +443,12 @@ TEST_F(WebApidTest, RefusesBadInputWithAClearError) {
   EXPECT_TRUE(Call(kSetting, "get", {{"x", nested(50)}}, sid).json["success"].asBool());
   const Reply deep = Call(kSetting, "get", {{"x", nested(62)}}, sid);
   EXPECT_EQ(Code(deep), 101) << deep.body;
+  // A form body of almost 1 MiB of control bytes, which JSON escapes sixfold.
+  const std::string controls =
+      Form({{"api", kSetting}, {"version", "1"}, {"method", "get"}, {"_sid", sid}}) +
+      "&pad=" + std::string((1 << 20) - 200, '\x01');
+  const Reply escaped = Send("POST", controls, {});
+  EXPECT_TRUE(escaped.json["success"].asBool()) << escaped.status << " " << escaped.body;
   EXPECT_TRUE(Call(kSetting, "get", {}, sid).json["success"].asBool());  // still serving
   EXPECT_THAT(host_->Log(), Not(HasSubstr("malformed call")));
 }

@@ -1,5 +1,5 @@
 # Sourced with a build folder as $1: exports the paths of that build's programs
-# that webapp/tests/system.mjs starts (the build does the same for ctest).
+# that webapp/tests/system.mjs starts.
 kova_webapp_here=$(cd "$(dirname "${BASH_SOURCE[0]}")" && pwd)
 kova_build=$(cd "$1" && pwd)
 export KOVA_WEBAPID=$kova_build/host/kova-webapid

@@ -3,8 +3,8 @@
 
 import assert from 'node:assert/strict';
 import {readFileSync} from 'node:fs';
-import {after, before, test} from 'node:test';
-import {launchBrowser, openPage, screenshot, signIn, startSystem, waitFor} from './system.mjs';
+import {test} from 'node:test';
+import {openPage, screenshot, signIn, useSystem, waitFor} from './system.mjs';
 
 let system, browser, page, problems;
 let boundary;  // the Unix second from which on the two later events were written
@@ -22,21 +22,16 @@ async function shows(range) {
   return table.locator('tbody td:nth-child(3)').allTextContents();
 }
 
-before(async () => {
-  system = await startSystem();
+useSystem({}, async (started) => {
+  ({system, browser} = started);
   for (let i = 1; i <= 25; i += 1) write('Warning', `Disk latency at ${i} ms`);
   boundary = Math.floor(Date.now() / 1000) + 1;
   await new Promise((resolve) => setTimeout(resolve, boundary * 1000 - Date.now() + 50));
   write('Critical', kLater[0]);
   write('Info', kLater[1]);
-  browser = await launchBrowser();
   ({page, problems} = await openPage(browser, system.url));
   await signIn(page);
   await page.getByRole('link', {name: 'Event log'}).click();
-});
-after(async () => {
-  await browser?.close();
-  await system?.stop();
 });
 
 test('events are listed newest first a page at a time and filtered by level, keyword and time', async () => {

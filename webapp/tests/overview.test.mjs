@@ -6,20 +6,13 @@
 
 import assert from 'node:assert/strict';
 import {spawn} from 'node:child_process';
-import {after, before, test} from 'node:test';
+import {test} from 'node:test';
 import {LiveStore} from '../www/js/live.js';
-import {apiSession, launchBrowser, openPage, screenshot, signIn, startSystem, waitFor} from './system.mjs';
+import {apiSession, openPage, screenshot, signIn, useSystem, waitFor} from './system.mjs';
 
 let system;
 let browser;
-before(async () => {
-  system = await startSystem();
-  browser = await launchBrowser();
-});
-after(async () => {
-  await browser?.close();
-  await system?.stop();
-});
+useSystem({}, (started) => ({system, browser} = started));
 
 const points = async (page, key) => Number(await page.locator(`[data-chart="${key}"]`).getAttribute('data-points'));
 

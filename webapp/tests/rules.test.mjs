@@ -3,19 +3,12 @@
 // rules deleted at once. The tests run in order on one system.
 
 import assert from 'node:assert/strict';
-import {after, before, test} from 'node:test';
-import {launchBrowser, openPage, screenshot, signIn, startSystem, waitFor} from './system.mjs';
+import {test} from 'node:test';
+import {openPage, screenshot, signIn, useSystem, waitFor} from './system.mjs';
 
 let system;
 let browser;
-before(async () => {
-  system = await startSystem();
-  browser = await launchBrowser();
-});
-after(async () => {
-  await browser?.close();
-  await system?.stop();
-});
+useSystem({}, (started) => ({system, browser} = started));
 
 async function openRules(viewport) {
   const opened = await openPage(browser, system.url, {viewport});

@@ -1,19 +1,12 @@
 // Sign-in, sign-out and an expired session, in English and German.
 
 import assert from 'node:assert/strict';
-import {after, before, test} from 'node:test';
-import {launchBrowser, openPage, screenshot, signIn, startSystem} from './system.mjs';
+import {test} from 'node:test';
+import {openPage, screenshot, signIn, useSystem} from './system.mjs';
 
 let system;
 let browser;
-before(async () => {
-  system = await startSystem();
-  browser = await launchBrowser();
-});
-after(async () => {
-  await browser?.close();
-  await system?.stop();
-});
+useSystem({}, (started) => ({system, browser} = started));
 
 test('a wrong password is refused in words, the right one signs in, sign-out returns', async () => {
   const {context, page, problems} = await openPage(browser, system.url);

@@ -4,19 +4,12 @@
 import assert from 'node:assert/strict';
 import {readFileSync} from 'node:fs';
 import {join} from 'node:path';
-import {after, before, test} from 'node:test';
-import {kAccount, kPassword, launchBrowser, openPage, screenshot, signIn, startSystem, waitFor} from './system.mjs';
+import {test} from 'node:test';
+import {kAccount, kPassword, openPage, screenshot, signIn, useSystem, waitFor} from './system.mjs';
 
 let system, browser;
-before(async () => {
-  system = await startSystem({settings: {resourcemonitor_realtime_max: '30',
-                                         resourcemonitor_performance_event: 'yes'}});
-  browser = await launchBrowser();
-});
-after(async () => {
-  await browser?.close();
-  await system?.stop();
-});
+useSystem({settings: {resourcemonitor_realtime_max: '30', resourcemonitor_performance_event: 'yes'}},
+          (started) => ({system, browser} = started));
 
 // A setting as /etc/kovainfo.conf holds it.
 const stored = (key) =>

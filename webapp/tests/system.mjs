@@ -8,6 +8,7 @@ import {chmodSync, cpSync, mkdirSync, mkdtempSync, readFileSync, rmSync, symlink
 import {tmpdir} from 'node:os';
 import {basename, dirname, join} from 'node:path';
 import {fileURLToPath} from 'node:url';
+import {after, before} from 'node:test';
 import {chromium} from 'playwright-core';
 
 export const kAccount = 'admin';
@@ -139,6 +140,23 @@ export async function apiSession(system) {
   const {sid} = await post({api: 'KOVA.API.Auth', version: '1', method: 'login', account: kAccount, password: kPassword});
   return (api, method, params = {}) => post({api, version: '1', method, _sid: sid,
     ...Object.fromEntries(Object.entries(params).map(([name, value]) => [name, JSON.stringify(value)]))});
+}
+
+// Starts a system (with `options`) and a browser before the tests of a file,
+// and stops both after them. `started({system, browser})` runs once both are
+// up, to keep them and prepare what the tests need.
+export function useSystem(options, started) {
+  let system;
+  let browser;
+  before(async () => {
+    system = await startSystem(options);
+    browser = await launchBrowser();
+    await started({system, browser});
+  });
+  after(async () => {
+    await browser?.close();
+    await system?.stop();
+  });
 }
 
 // Debian's chromium, headless, with nothing that reaches out to the network.

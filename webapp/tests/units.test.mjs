@@ -2,20 +2,12 @@
 // prefixes, the log's server-local times, axis labels.
 
 import assert from 'node:assert/strict';
-import {after, before, test} from 'node:test';
-import {launchBrowser, openPage, startSystem} from './system.mjs';
+import {test} from 'node:test';
+import {openPage, useSystem} from './system.mjs';
 
-let system;
-let browser;
 let page;
-before(async () => {
-  system = await startSystem();
-  browser = await launchBrowser();
+useSystem({}, async ({system, browser}) => {
   ({page} = await openPage(browser, system.url));
-});
-after(async () => {
-  await browser?.close();
-  await system?.stop();
 });
 
 // Evaluates `body` in the page with the module at `path` as `m`.

@@ -46,21 +46,18 @@ function formBody(api, method, params) {
   return body;
 }
 
-async function post(body, signal) {
-  let reply;
+// Posts `body` with the session's token (or `sessionToken`).
+async function post(body, sessionToken = token) {
   try {
-    reply = await fetch(kEntry, {
+    return await fetch(kEntry, {
       method: 'POST',
       body,
-      headers: token ? {'X-KOVA-Token': token} : {},
+      headers: sessionToken ? {'X-KOVA-Token': sessionToken} : {},
       credentials: 'same-origin',
-      signal,
     });
-  } catch (error) {
-    if (error.name === 'AbortError') throw error;
+  } catch {
     throw new ApiError(0, null, 'the server can not be reached');
   }
-  return reply;
 }
 
 async function answerOf(reply) {
@@ -79,8 +76,8 @@ async function answerOf(reply) {
 // Calls `method` of `api`, version 1. Resolves to the answer's data; rejects
 // with an ApiError (code 0 when the server can't be reached or its answer is no
 // JSON). A call that finds the session gone ends it for the whole app.
-export async function call(api, method, params = {}, {signal} = {}) {
-  return answerOf(await post(formBody(api, method, params), signal));
+export async function call(api, method, params = {}) {
+  return answerOf(await post(formBody(api, method, params)));
 }
 
 // Signs in. Resolves to the account on success, rejects with an ApiError.
@@ -99,12 +96,8 @@ export async function signIn(name, password) {
 export async function signOut() {
   const ended = token;
   endSession('signed_out');
-  try {
-    const body = formBody('KOVA.API.Auth', 'logout', {});
-    await fetch(kEntry, {method: 'POST', body, headers: {'X-KOVA-Token': ended}, credentials: 'same-origin'});
-  } catch {
-    // The session is gone either way.
-  }
+  // The session is gone for the app either way.
+  await post(formBody('KOVA.API.Auth', 'logout', {}), ended).catch(() => {});
 }
 
 // Calls a method that answers with a file, and hands the file to the browser

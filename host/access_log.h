@@ -10,24 +10,22 @@
 
 namespace kova_host {
 
-// What the request's handler learnt, for the request's line. One per thread:
-// a request is handled on one thread from start to end.
+// What the request's handler learnt, for the request's line.
 struct AccessRecord {
-  std::chrono::steady_clock::time_point start{};
   std::string api, method, user;
   int code = -1;  // the answer's code, 0 for success; -1 when no call was answered
 };
-AccessRecord& CurrentAccess();
 
-// The line for a request and its record, without the trailing newline. Names
-// are cut short and stripped of blanks and control characters.
+// The line for a request that took `took` and its record, without the trailing
+// newline. Names are cut short; blanks, quotes, backslashes, control bytes and
+// bytes from 0x80 are written as \xNN, so every line is printable ASCII.
 std::string AccessLine(const std::string& remote, const std::string& http_method,
                        const std::string& path, int status, const AccessRecord& record,
-                       std::chrono::steady_clock::time_point end);
+                       std::chrono::steady_clock::duration took);
 
-// Writes the line of the request that just ended and clears the record.
+// Writes the line of a request that just ended.
 void LogAccess(const std::string& remote, const std::string& http_method, const std::string& path,
-               int status);
+               int status, const AccessRecord& record, std::chrono::steady_clock::duration took);
 
 }  // namespace kova_host
 

@@ -5,12 +5,14 @@
 #include <sys/prctl.h>
 #include <unistd.h>
 
+#include <future>
 #include <thread>
 
 #include "host/access_log.h"
 #include "host/host_log.h"
 #include "host/json_text.h"
 #include "host/monitor.h"
+#include "host/runner_pool.h"
 #include "host/web_entry.h"
 #include "kova/webapi.h"
 
@@ -47,10 +49,24 @@ EntryRequest ToEntry(const httplib::Request& request) {
   return entry;
 }
 
-void Send(const EntryReply& reply, httplib::Response& response) {
+// What the access log tells of the request a thread is serving.
+AccessRecord& CurrentAccess() {
+  thread_local AccessRecord record;
+  return record;
+}
+thread_local std::chrono::steady_clock::time_point request_start;
+
+// Hands the request to the entry and waits for its reply.
+void Serve(WebEntry& entry, EntryRequest request, httplib::Response& response) {
+  std::promise<EntryReply> promise;
+  std::future<EntryReply> future = promise.get_future();
+  entry.Handle(std::move(request),
+               [&promise](EntryReply reply) { promise.set_value(std::move(reply)); });
+  const EntryReply reply = future.get();
   response.status = reply.status;
   for (const auto& [name, value] : reply.headers) response.set_header(name, value);
   response.set_content(reply.body, reply.content_type);
+  CurrentAccess() = reply.access;
 }
 
 // Errors that no handler answered (an unknown path, a body over the limit)
@@ -96,19 +112,22 @@ int RunFrontEnd(int control, const Options& options, const Identity* account) {
   if (chdir("/") != 0) return 1;
 
   MonitorClient monitor(control);
-  RunnerClient runner(monitor, options.call_timeout);
-  if (!runner.Start(error)) HostLog("no runner yet: %s", error.c_str());
+  RunnerPool runners(monitor, options.call_timeout, options.max_waiting_calls);
+  if (!runners.Start(options.modules_dir, error)) {
+    HostLog("%s", error.c_str());
+    return 1;
+  }
   SessionStore sessions(options.idle_timeout, 10000);
   LoginThrottle throttle;
   WebEntry entry(
-      runner,
+      runners,
       [&monitor](const std::string& name, const std::string& password, bool& admin) {
         return monitor.CheckPassword(name, password, admin);
       },
-      sessions, throttle);
+      sessions, throttle, [](std::function<void()> work) { work(); });
 
   const auto handle = [&entry](const httplib::Request& request, httplib::Response& response) {
-    Send(entry.Handle(ToEntry(request)), response);
+    Serve(entry, ToEntry(request), response);
   };
   server.Get(kEntryPath, handle);
   // The body is read here: the library itself would cap form bodies at 8 KiB.
@@ -125,13 +144,13 @@ int RunFrontEnd(int control, const Options& options, const Identity* account) {
     }
     EntryRequest entry_request = ToEntry(request);
     entry_request.body = std::move(body);
-    Send(entry.Handle(entry_request), response);
+    Serve(entry, std::move(entry_request), response);
   });
   server.set_payload_max_length(kMaxBody);
   server.set_keep_alive_max_count(1000);
   server.new_task_queue = [] { return new httplib::ThreadPool(16); };
   server.set_pre_routing_handler([](const httplib::Request&, httplib::Response&) {
-    CurrentAccess().start = std::chrono::steady_clock::now();
+    request_start = std::chrono::steady_clock::now();
     return httplib::Server::HandlerResponse::Unhandled;
   });
   server.set_error_handler(httplib::Server::HandlerWithResponse(OnError));
@@ -142,7 +161,9 @@ int RunFrontEnd(int control, const Options& options, const Identity* account) {
                              "application/json; charset=utf-8");
       });
   server.set_logger([](const httplib::Request& request, const httplib::Response& response) {
-    LogAccess(request.remote_addr, request.method, request.path, response.status);
+    LogAccess(request.remote_addr, request.method, request.path, response.status, CurrentAccess(),
+              std::chrono::steady_clock::now() - request_start);
+    CurrentAccess() = AccessRecord();
   });
   // The web app loads nothing from another origin and runs no inline script or
   // style, so its pages can be held to this policy.

@@ -67,6 +67,6 @@ int main(int argc, char** argv) {
     _exit(kova_host::RunFrontEnd(control[1], options, drop));
   }
   close(control[1]);
-  const kova_host::RunnerSetup setup{options.modules_dir, drop};
+  const kova_host::MonitorSetup setup{options.modules_dir, drop, root + "/tmp"};
   return kova_host::RunMonitor(control[0], front_end, setup);
 }

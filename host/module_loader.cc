@@ -2,9 +2,11 @@
 
 #include <dirent.h>
 #include <dlfcn.h>
+#include <errno.h>
 
 #include <algorithm>
 #include <climits>
+#include <cstring>
 #include <set>
 #include <tuple>
 
@@ -19,26 +21,35 @@ std::string Describe(const Key& key) {
   return std::get<0>(key) + " v" + std::to_string(std::get<1>(key)) + " " + std::get<2>(key);
 }
 
-std::vector<std::string> ModuleFiles(const std::string& dir) {
-  std::vector<std::string> files;
-  DIR* stream = opendir(dir.c_str());
-  if (stream == nullptr) {
-    HostLog("no modules: cannot open %s", dir.c_str());
-    return files;
-  }
-  while (const dirent* entry = readdir(stream)) {
-    const std::string name = entry->d_name;
-    if (name.size() > 3 && name.compare(name.size() - 3, 3, ".so") == 0 && name[0] != '.') {
-      files.push_back(dir + "/" + name);
-    }
-  }
-  closedir(stream);
-  std::sort(files.begin(), files.end());
-  return files;
+}  // namespace
+
+bool IsModuleName(const std::string& name) {
+  return name.size() > 3 && name.compare(name.size() - 3, 3, ".so") == 0 && name[0] != '.' &&
+         name.find('/') == std::string::npos;
 }
 
-// Loads one module; "" or why it was left out.
-std::string Load(const std::string& path, LoadedModule& module) {
+bool ListModules(const std::string& dir, std::vector<std::string>& names, std::string& error) {
+  names.clear();
+  DIR* stream = opendir(dir.c_str());
+  if (stream == nullptr) {
+    error = "cannot open the modules folder " + dir + ": " + strerror(errno);
+    return false;
+  }
+  errno = 0;
+  while (const dirent* entry = readdir(stream)) {
+    if (IsModuleName(entry->d_name)) names.emplace_back(entry->d_name);
+  }
+  const int failed = errno;
+  closedir(stream);
+  if (failed != 0) {
+    error = "cannot read the modules folder " + dir + ": " + strerror(failed);
+    return false;
+  }
+  std::sort(names.begin(), names.end());
+  return true;
+}
+
+std::string LoadModule(const std::string& path, LoadedModule& module) {
   void* handle = dlopen(path.c_str(), RTLD_NOW | RTLD_LOCAL);
   if (handle == nullptr) return dlerror();
   auto get_table = reinterpret_cast<GetAPITableFunc>(dlsym(handle, kGetAPITableSymbol));
@@ -61,8 +72,6 @@ std::string Load(const std::string& path, LoadedModule& module) {
   module = {path, handle, table};
   return "";
 }
-
-}  // namespace
 
 std::string CheckTables(const APITableEntry* table, const APICheckEntry* checks) {
   std::set<Key> methods;
@@ -90,20 +99,6 @@ std::string CheckTables(const APITableEntry* table, const APICheckEntry* checks)
     if (row->check == nullptr) return "the check of " + Describe(key) + " has no callback";
   }
   return "";
-}
-
-std::vector<LoadedModule> LoadModules(const std::string& dir) {
-  std::vector<LoadedModule> modules;
-  for (const std::string& path : ModuleFiles(dir)) {
-    LoadedModule module;
-    const std::string fault = Load(path, module);
-    if (fault.empty()) {
-      modules.push_back(module);
-    } else {
-      HostLog("module %s left out: %s", path.c_str(), fault.c_str());
-    }
-  }
-  return modules;
 }
 
 }  // namespace kova_host

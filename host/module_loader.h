@@ -26,10 +26,17 @@ struct LoadedModule {
   const APITableEntry* table = nullptr;
 };
 
-// Loads every *.so of `dir`, in name order, checks its tables and registers its
-// methods. A module that can't be loaded, whose tables fail the checks or that
-// repeats another's method is reported on standard error and left out.
-std::vector<LoadedModule> LoadModules(const std::string& dir);
+// The file names of the modules in `dir` (every *.so not starting with a
+// dot), in name order. False with `error` when the folder can't be read.
+bool ListModules(const std::string& dir, std::vector<std::string>& names, std::string& error);
+
+// Whether `name` could be a name that ListModules gives: no path.
+bool IsModuleName(const std::string& name);
+
+// Loads the module at `path`, checks its tables and registers its methods.
+// "" on success; else why it was left out (it can't be loaded, its tables
+// fail the checks or it repeats a method registered already).
+std::string LoadModule(const std::string& path, LoadedModule& module);
 
 }  // namespace kova_host
 

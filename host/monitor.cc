@@ -7,10 +7,13 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstring>
 
 #include "host/host_log.h"
 #include "host/json_text.h"
+#include "host/module_loader.h"
+#include "host/private_tmp.h"
 #include "src/accounts.h"
 
 namespace kova_host {
@@ -84,7 +87,7 @@ int Receive(int socket, Json::Value& message, int* fd = nullptr) {
   return ok ? 1 : -1;
 }
 
-std::string Ended(int status) {
+std::string HowEnded(int status) {
   if (WIFSIGNALED(status)) {
     const int signal = WTERMSIG(status);
     return "killed by signal " + std::to_string(signal) + " (" + strsignal(signal) + ")";
@@ -94,7 +97,7 @@ std::string Ended(int status) {
 
 class Monitor {
  public:
-  Monitor(int control, pid_t front_end, const RunnerSetup& setup)
+  Monitor(int control, pid_t front_end, const MonitorSetup& setup)
       : control_(control), front_end_(front_end), setup_(setup) {}
 
   int Run() {
@@ -117,9 +120,13 @@ class Monitor {
     if (got == 0) return false;
     if (got < 0) return Send(control_, Failure("malformed request"));
     const Json::Value& op = request["op"];
-    if (op == "start") return StartRunner();
+    const std::string module = request["module"].isString() ? request["module"].asString() : "";
+    if ((op == "start" || op == "stop") && !IsModuleName(module)) {
+      return Send(control_, Failure("no such module"));
+    }
+    if (op == "start") return StartRunner(module);
     if (op == "stop") {
-      StopRunner();
+      StopRunner(module);
       return Send(control_, Json::Value(Json::objectValue));
     }
     if (op == "check" && request["account"].isString() && request["password"].isString()) {
@@ -139,39 +146,67 @@ class Monitor {
     return answer;
   }
 
-  bool StartRunner() {
-    StopRunner();
+  struct Runner {
+    pid_t pid = 0;
+    std::string tmp_root;  // its private /tmp's folder, "" when it shares /tmp
+  };
+
+  bool StartRunner(const std::string& module) {
+    StopRunner(module);
+    RunnerSetup runner_setup{setup_.modules_dir + "/" + module, setup_.account, "", setup_.tmp_dir};
+    Runner runner;
+    if (geteuid() == 0) {
+      std::string error;
+      runner_setup.private_tmp = MakePrivateTmp(setup_.tmp_dir, runner.tmp_root, error);
+      if (runner_setup.private_tmp.empty())
+        HostLog("runner of %s: %s", module.c_str(), error.c_str());
+    }
     int pair[2];
     if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0) {
+      Ended(module, runner, 0);
       return Send(control_, Failure(std::string("socketpair: ") + strerror(errno)));
     }
-    const pid_t pid = fork();
-    if (pid == 0) {
+    runner.pid = fork();
+    if (runner.pid == 0) {
       for (int signal : {SIGTERM, SIGHUP, SIGINT}) ::signal(signal, SIG_DFL);
       close(control_);
       close(pair[0]);
-      _exit(RunRunner(pair[1], setup_));
+      _exit(RunRunner(pair[1], runner_setup));
     }
     close(pair[1]);
-    if (pid < 0) {
+    if (runner.pid < 0) {
       close(pair[0]);
+      Ended(module, runner, 0);
       return Send(control_, Failure(std::string("fork: ") + strerror(errno)));
     }
-    runner_ = pid;
+    runners_[module] = runner;
     const bool sent = Send(control_, Json::Value(Json::objectValue), pair[0]);
     close(pair[0]);
     return sent;
   }
 
-  void StopRunner() {
-    if (runner_ <= 0) return;
+  void StopRunner(const std::string& module) {
+    const auto found = runners_.find(module);
+    if (found == runners_.end()) return;
     // A runner that is ending already keeps the status it ends with.
-    kill(runner_, SIGKILL);
+    kill(found->second.pid, SIGKILL);
     int status;
-    while (waitpid(runner_, &status, 0) < 0 && errno == EINTR) {
+    while (waitpid(found->second.pid, &status, 0) < 0 && errno == EINTR) {
     }
-    HostLog("runner %d %s", static_cast<int>(runner_), Ended(status).c_str());
-    runner_ = 0;
+    const Runner runner = found->second;
+    runners_.erase(found);
+    Ended(module, runner, status);
+  }
+
+  // Logs how a runner ended (when it was started) and removes its /tmp.
+  static void Ended(const std::string& module, const Runner& runner, int status) {
+    if (runner.pid > 0) {
+      HostLog("runner %d of %s %s", static_cast<int>(runner.pid), module.c_str(),
+              HowEnded(status).c_str());
+    }
+    if (!runner.tmp_root.empty() && !RemovePrivateTmp(runner.tmp_root)) {
+      HostLog("cannot remove all of %s", runner.tmp_root.c_str());
+    }
   }
 
   // Collects ended children; with `block`, waits for the front-end.
@@ -183,9 +218,14 @@ class Monitor {
         if (pid < 0 && errno == EINTR) continue;
         return;
       }
-      if (pid == runner_) {
-        HostLog("runner %d %s", static_cast<int>(pid), Ended(status).c_str());
-        runner_ = 0;
+      const auto runner = std::find_if(runners_.begin(), runners_.end(), [pid](const auto& entry) {
+        return entry.second.pid == pid;
+      });
+      if (runner != runners_.end()) {
+        const std::string module = runner->first;
+        const Runner ended = runner->second;
+        runners_.erase(runner);
+        Ended(module, ended, status);
       } else if (pid == front_end_) {
         front_end_ended_ = true;
         front_end_status_ = status;
@@ -195,7 +235,7 @@ class Monitor {
 
   void Shutdown() {
     shutdown(control_, SHUT_RDWR);  // requests of the front-end fail now instead of waiting
-    StopRunner();
+    while (!runners_.empty()) StopRunner(runners_.begin()->first);
     if (!front_end_ended_) {
       kill(front_end_, SIGTERM);
       for (int i = 0; i < 50 && !front_end_ended_; ++i) {
@@ -209,15 +249,15 @@ class Monitor {
 
   int control_;
   pid_t front_end_;
-  const RunnerSetup& setup_;
-  pid_t runner_ = 0;
+  const MonitorSetup& setup_;
+  std::map<std::string, Runner> runners_;  // by module
   bool front_end_ended_ = false;
   int front_end_status_ = 0;
 };
 
 }  // namespace
 
-int RunMonitor(int control, pid_t front_end, const RunnerSetup& setup) {
+int RunMonitor(int control, pid_t front_end, const MonitorSetup& setup) {
   struct sigaction action {};
   action.sa_handler = OnStopSignal;  // no SA_RESTART: a signal ends the wait
   sigemptyset(&action.sa_mask);
@@ -225,10 +265,11 @@ int RunMonitor(int control, pid_t front_end, const RunnerSetup& setup) {
   return Monitor(control, front_end, setup).Run();
 }
 
-int MonitorClient::Start(std::string& error) {
+int MonitorClient::Start(const std::string& module, std::string& error) {
   std::lock_guard lock(mutex_);
   Json::Value request;
   request["op"] = "start";
+  request["module"] = module;
   Json::Value answer;
   int fd = -1;
   if (!Send(control_, request) || Receive(control_, answer, &fd) != 1) {
@@ -239,10 +280,11 @@ int MonitorClient::Start(std::string& error) {
   return fd;
 }
 
-void MonitorClient::Stop() {
+void MonitorClient::Stop(const std::string& module) {
   std::lock_guard lock(mutex_);
   Json::Value request;
   request["op"] = "stop";
+  request["module"] = module;
   Json::Value answer;
   if (Send(control_, request)) Receive(control_, answer);
 }

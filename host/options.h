@@ -17,6 +17,13 @@ struct Options {
   std::string static_dir;       // default: /usr/share/kova/www under the system root
   std::chrono::seconds idle_timeout{900};
   std::chrono::seconds call_timeout{120};
+  size_t max_waiting_calls = 256;  // per module, besides the running call
+  // Limits of the HTTP front-end.
+  size_t max_connections = 10000;
+  size_t max_per_address = 256;                // connections from one client address
+  std::chrono::seconds header_timeout{10};     // to read a request's line and header
+  std::chrono::seconds body_timeout{30};       // to read its body
+  std::chrono::seconds keepalive_timeout{60};  // a connection idle between requests
 };
 
 extern const char kUsage[];

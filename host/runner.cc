@@ -1,12 +1,16 @@
 #include "host/runner.h"
 
+#include <errno.h>
 #include <fcntl.h>
+#include <sched.h>
 #include <signal.h>
 #include <sys/mman.h>
+#include <sys/mount.h>
 #include <sys/prctl.h>
 #include <unistd.h>
 
 #include <cstdio>
+#include <cstring>
 #include <exception>
 
 #include "host/host_log.h"
@@ -105,6 +109,21 @@ RunnerAnswer ExecuteCall(const RunnerCall& call) {
   return Error(KOVA::kAPIErrorUnknown, Reason("the handler gave no answer"));
 }
 
+namespace {
+
+// Mounts `folder` over `tmp` in a mount namespace of the process's own.
+bool MountPrivateTmp(const std::string& folder, const std::string& tmp, std::string& error) {
+  if (unshare(CLONE_NEWNS) != 0 ||
+      mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0 ||
+      mount(folder.c_str(), tmp.c_str(), nullptr, MS_BIND, nullptr) != 0) {
+    error = strerror(errno);
+    return false;
+  }
+  return true;
+}
+
+}  // namespace
+
 int RunRunner(int fd, const RunnerSetup& setup) {
   const pid_t parent = getppid();
   signal(SIGINT, SIG_IGN);  // the monitor stops the runner
@@ -117,6 +136,10 @@ int RunRunner(int fd, const RunnerSetup& setup) {
   close(null);
   close(output);
   std::string error;
+  if (!setup.private_tmp.empty() && !MountPrivateTmp(setup.private_tmp, setup.tmp_dir, error)) {
+    HostLog("runner: no %s of its own (%s): files a killed call made there stay",
+            setup.tmp_dir.c_str(), error.c_str());
+  }
   if (setup.account != nullptr && !TakeEffectiveIds(*setup.account, error)) {
     HostLog("runner: cannot take the ids of %s: %s", setup.account->name.c_str(), error.c_str());
     return 1;
@@ -124,13 +147,19 @@ int RunRunner(int fd, const RunnerSetup& setup) {
   // Set after the ids changed, which clears it; the runner ends with the monitor.
   if (prctl(PR_SET_PDEATHSIG, SIGKILL) != 0 || getppid() != parent) return 1;
   const IdSnapshot ids = SnapshotIds();
-  LoadModules(setup.modules_dir);
+  LoadedModule module;
+  if (const std::string fault = LoadModule(setup.module_path, module); !fault.empty()) {
+    HostLog("module %s left out: %s", setup.module_path.c_str(), fault.c_str());
+  }
   if (SendReady(fd, KOVA::APIRunner::List()) != IoResult::kOk) return 1;
   FrameReader reader(fd);
   for (;;) {
     RunnerCall call;
     const IoResult got = ReceiveCall(reader, call);
     if (got == IoResult::kClosed) return 0;
+    if ((got == IoResult::kOk || got == IoResult::kMalformed) && SendTaken(fd) != IoResult::kOk) {
+      return 1;
+    }
     if (got == IoResult::kMalformed) {
       // The frame was read whole, so the runner answers it and takes the next.
       HostLog("runner: refused a malformed call from the front-end");

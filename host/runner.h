@@ -12,10 +12,15 @@
 namespace kova_host {
 
 struct RunnerSetup {
-  std::string modules_dir;
+  std::string module_path;  // the one module the runner serves
   // The account whose effective ids the runner takes (real and saved ids stay
   // 0); null to keep the process's own ids.
   const Identity* account = nullptr;
+  // A folder mounted over the system's temporary folder `tmp_dir` for the
+  // runner alone, so that whatever a call leaves there goes with the runner;
+  // empty to share it.
+  std::string private_tmp;
+  std::string tmp_dir;
 };
 
 // Serves calls on `fd` until the front-end closes it. Returns the exit status.

@@ -35,16 +35,16 @@ const char* Why(IoResult result) {
 struct RunnerClient::Pending {
   std::string message;  // the encoded call
   std::string name;     // for the log
-  RunnerAnswer* answer = nullptr;
-  std::string error;
-  bool ok = false;
-  bool done = false;
-  std::condition_variable finished;  // one per call: only its own thread wakes
+  int retried = 0;      // times a runner ended before taking it
+  RunnerAnswer answer;
+  CallDone done;
 };
 
-RunnerClient::RunnerClient(RunnerLauncher& launcher, std::chrono::milliseconds call_timeout)
+RunnerClient::RunnerClient(RunnerLauncher& launcher, std::chrono::milliseconds call_timeout,
+                           size_t max_waiting)
     : launcher_(launcher),
       call_timeout_(call_timeout),
+      max_waiting_(max_waiting),
       wake_fd_(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)),
       methods_(std::make_shared<const Json::Value>(Json::arrayValue)) {}
 
@@ -97,46 +97,56 @@ void RunnerClient::StopRunner() {
   launcher_.Stop();
 }
 
-bool RunnerClient::Call(const RunnerCall& call, RunnerAnswer& answer, std::string& error) {
-  Pending pending;
-  pending.message = EncodeCall(call);
-  pending.name = call.api + " v" + std::to_string(call.version) + " " + call.method;
-  pending.answer = &answer;
+void RunnerClient::Submit(const RunnerCall& call, CallDone done) {
+  auto pending = std::make_unique<Pending>();
+  pending->message = EncodeCall(call);
+  pending->name = call.api + " v" + std::to_string(call.version) + " " + call.method;
+  pending->done = std::move(done);
+  CallResult refused = CallResult::kAnswered;
   {
     std::lock_guard lock(mutex_);
     if (stopping_) {
-      error = "the host is stopping";
-      return false;
+      refused = CallResult::kFailed;
+    } else if (queue_.size() >= max_waiting_) {
+      refused = CallResult::kBusy;
+    } else {
+      queue_.push_back(pending.release());
     }
-    queue_.push_back(&pending);
+  }
+  if (refused != CallResult::kAnswered) {
+    pending->done(refused, RunnerAnswer(),
+                  refused == CallResult::kBusy ? "too many calls wait for the module"
+                                               : "the host is stopping");
+    return;
   }
   const uint64_t one = 1;
   [[maybe_unused]] const ssize_t ignored = write(wake_fd_, &one, sizeof(one));
-  std::unique_lock lock(mutex_);
-  pending.finished.wait(lock, [&] { return pending.done; });
-  error = pending.error;
-  return pending.ok;
 }
 
-void RunnerClient::Finish(Pending* pending, bool ok, const std::string& error) {
-  std::lock_guard lock(mutex_);
-  pending->ok = ok;
-  pending->error = error;
-  pending->done = true;
-  pending->finished.notify_one();
+void RunnerClient::Finish(Pending* pending, CallResult result, const std::string& error) {
+  const std::unique_ptr<Pending> owned(pending);
+  owned->done(result, std::move(owned->answer), error);
 }
 
-void RunnerClient::Abandon(const std::string& error) {
+void RunnerClient::Abandon(IoResult why) {
   Pending* running = sent_.front();
-  sent_.pop_front();
-  HostLog("%s: %s; starting a fresh runner", running->name.c_str(), error.c_str());
+  // A runner that ended before taking the call never ran it: the call goes to
+  // a fresh runner, once, with those behind it.
+  const bool retry = !taken_ && why != IoResult::kTimeout && running->retried++ == 0;
+  if (retry) {
+    HostLog("%s: the runner ended before taking the call; a fresh runner takes it",
+            running->name.c_str());
+  } else {
+    sent_.pop_front();
+    HostLog("%s: %s; starting a fresh runner", running->name.c_str(), Why(why));
+  }
   StopRunner();
   {
     std::lock_guard lock(mutex_);
     queue_.insert(queue_.begin(), sent_.begin(), sent_.end());
   }
   sent_.clear();
-  Finish(running, false, error);
+  if (!retry) Finish(running, CallResult::kFailed, Why(why));
 }
 
 bool RunnerClient::SendWaiting() {
@@ -149,11 +159,14 @@ bool RunnerClient::SendWaiting() {
       next = queue_.front();
       queue_.pop_front();
     }
-    if (sent_.empty()) running_since_ = Clock::now();
+    if (sent_.empty()) {
+      running_since_ = Clock::now();
+      taken_ = false;
+    }
     sent_.push_back(next);
     const IoResult sent = WriteFrame(fd_, next->message, running_since_ + call_timeout_);
     if (sent != IoResult::kOk) {
-      Abandon(Why(sent));
+      Abandon(sent);
       return false;
     }
   }
@@ -179,7 +192,7 @@ void RunnerClient::Dispatch() {
           std::lock_guard lock(mutex_);
           failed.swap(queue_);
         }
-        for (Pending* pending : failed) Finish(pending, false, "no runner: " + error);
+        for (Pending* pending : failed) Finish(pending, CallResult::kFailed, "no runner: " + error);
         continue;
       }
     }
@@ -214,17 +227,23 @@ void RunnerClient::Dispatch() {
     }
     if (fd_ >= 0 && (buffered || fds[1].revents != 0)) {
       Pending* running = sent_.front();
+      bool taken = false;
       const IoResult got =
-          ReceiveAnswer(*reader_, *running->answer, running_since_ + call_timeout_);
+          ReceiveAnswer(*reader_, taken, running->answer, running_since_ + call_timeout_);
       if (got != IoResult::kOk) {
-        Abandon(Why(got));
+        Abandon(got);
+        continue;
+      }
+      running_since_ = Clock::now();  // a call's time runs from when the runner takes it
+      if (taken) {
+        taken_ = true;
         continue;
       }
       sent_.pop_front();
-      running_since_ = Clock::now();  // the runner goes on to the next call at once
-      Finish(running, true, "");
+      taken_ = false;
+      Finish(running, CallResult::kAnswered, "");
     } else if (Clock::now() >= running_since_ + call_timeout_) {
-      Abandon(Why(IoResult::kTimeout));
+      Abandon(IoResult::kTimeout);
     }
   }
   // Stopping: nothing more is answered.
@@ -235,7 +254,7 @@ void RunnerClient::Dispatch() {
   }
   left.insert(left.end(), sent_.begin(), sent_.end());
   sent_.clear();
-  for (Pending* pending : left) Finish(pending, false, "the host is stopping");
+  for (Pending* pending : left) Finish(pending, CallResult::kFailed, "the host is stopping");
 }
 
 std::shared_ptr<const Json::Value> RunnerClient::Methods() const {

@@ -1,10 +1,10 @@
-// The front-end's side of the runner. The runner runs one call at a time; a
-// dispatcher thread hands it the calls of all request threads in their order,
+// The front-end's side of one runner. The runner runs one call at a time; a
+// dispatcher thread hands it the calls submitted, in their order,
 // keeping the next call waiting in the runner's socket so that the runner goes
 // from one call to the next without waiting for the front-end. Each call is
 // bounded in time from when the runner starts it; a runner that dies or runs
 // late is stopped, the call that it was running fails, and a fresh runner takes
-// the calls that were waiting.
+// the calls that were waiting, and a call that the runner had not yet taken.
 
 #ifndef KOVA_HOST_RUNNER_CLIENT_H_
 #define KOVA_HOST_RUNNER_CLIENT_H_
@@ -13,8 +13,8 @@
 
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
 #include <deque>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -34,9 +34,19 @@ class RunnerLauncher {
   virtual void Stop() = 0;
 };
 
+enum class CallResult {
+  kAnswered,  // the runner answered; the answer holds it
+  kFailed,    // the runner died or ran late running the call, or none could start
+  kBusy,      // too many calls wait for the runner already
+};
+// Receives a call's outcome, with what went wrong when it was not answered.
+using CallDone = std::function<void(CallResult result, RunnerAnswer answer, std::string error)>;
+
 class RunnerClient {
  public:
-  RunnerClient(RunnerLauncher& launcher, std::chrono::milliseconds call_timeout);
+  // At most `max_waiting` calls wait for the runner besides the running one.
+  RunnerClient(RunnerLauncher& launcher, std::chrono::milliseconds call_timeout,
+               size_t max_waiting);
   ~RunnerClient();
   RunnerClient(const RunnerClient&) = delete;
   RunnerClient& operator=(const RunnerClient&) = delete;
@@ -45,9 +55,10 @@ class RunnerClient {
   // dispatcher. The dispatcher starts runners itself from then on.
   bool Start(std::string& error);
 
-  // Runs one call. False with `error` when the runner failed to answer in
-  // time, or died, while running it.
-  bool Call(const RunnerCall& call, RunnerAnswer& answer, std::string& error);
+  // Queues a call. `done` runs exactly once: at once when the queue is full
+  // (kBusy) or the client is stopping (kFailed), else on the dispatcher's
+  // thread when the call ends. It must not block.
+  void Submit(const RunnerCall& call, CallDone done);
 
   // The methods the last started runner serves: {"api", "version", "method"};
   // empty while no runner has started.
@@ -61,13 +72,16 @@ class RunnerClient {
   void Dispatch();
   // Sends waiting calls while the runner holds at most one unanswered call.
   bool SendWaiting();
-  void Finish(Pending* pending, bool ok, const std::string& error);
-  // The runner failed running the first unanswered call: that call fails, the
-  // others go back to the front of the queue for a fresh runner.
-  void Abandon(const std::string& error);
+  // Hands the outcome to the call's owner and frees it.
+  void Finish(Pending* pending, CallResult result, const std::string& error);
+  // The runner failed (`why`) with the first unanswered call: that call fails
+  // unless the runner never took it, and the others go back to the front of
+  // the queue for a fresh runner.
+  void Abandon(IoResult why);
 
   RunnerLauncher& launcher_;
   const std::chrono::milliseconds call_timeout_;
+  const size_t max_waiting_;
   int wake_fd_ = -1;  // an eventfd: new calls are queued, or stop
   std::thread dispatcher_;
 
@@ -79,6 +93,7 @@ class RunnerClient {
   int fd_ = -1;
   std::unique_ptr<FrameReader> reader_;
   std::deque<Pending*> sent_;  // sent calls, the first one running
+  bool taken_ = false;         // the runner has taken the first sent call
   Clock::time_point running_since_;
 
   mutable std::mutex methods_mutex_;

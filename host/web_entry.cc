@@ -4,7 +4,6 @@
 #include <map>
 #include <set>
 
-#include "host/access_log.h"
 #include "host/cgi_output.h"
 #include "host/host_log.h"
 #include "host/json_text.h"
@@ -15,11 +14,24 @@ namespace kova_host {
 constexpr char kInfoApi[] = "KOVA.API.Info";
 constexpr char kAuthApi[] = "KOVA.API.Auth";
 
-// The decoded call: its parameters' texts, and the API, version and method.
+// A request on its way: its parameters' texts once decoded, the API, version
+// and method, and what the access log learns of it.
 struct WebEntry::Call {
+  EntryRequest request;
+  ReplyDone done;
+  bool answered = false;
   std::map<std::string, std::string> fields;
   std::string api, method;
   int version = 0;
+  AccessRecord access;
+
+  void Answer(EntryReply reply) {
+    if (answered) return;
+    answered = true;
+    access.code = reply.access.code;
+    reply.access = access;
+    done(std::move(reply));
+  }
 
   const std::string* Field(const std::string& name) const {
     auto it = fields.find(name);
@@ -36,7 +48,7 @@ EntryReply Json(const Json::Value& envelope, int status = 200) {
   reply.status = status;
   reply.body = ToJson(envelope);
   reply.headers.emplace_back("Cache-Control", "no-store");
-  CurrentAccess().code = envelope["success"].asBool() ? 0 : envelope["error"]["code"].asInt();
+  reply.access.code = envelope["success"].asBool() ? 0 : envelope["error"]["code"].asInt();
   return reply;
 }
 
@@ -92,19 +104,29 @@ std::string SessionCookie(const std::string& sid) {
 
 }  // namespace
 
-EntryReply WebEntry::Handle(const EntryRequest& request) {
+template <typename Make>
+void WebEntry::AnswerWith(const CallPtr& call, Make make) {
   try {
-    Call call;
-    return Dispatch(request, call);
+    if (std::optional<EntryReply> reply = make()) call->Answer(std::move(*reply));
+    return;
   } catch (const std::exception& e) {
     HostLog("entry: %s", e.what());
   } catch (...) {
     HostLog("entry: unknown exception");
   }
-  return Error(KOVA::kAPIErrorUnknown, "the host failed", 500);
+  call->Answer(Error(KOVA::kAPIErrorUnknown, "the host failed", 500));
 }
 
-EntryReply WebEntry::Dispatch(const EntryRequest& request, Call& call) {
+void WebEntry::Handle(EntryRequest request, ReplyDone done) {
+  auto call = std::make_shared<Call>();
+  call->request = std::move(request);
+  call->done = std::move(done);
+  AnswerWith(call, [&] { return Dispatch(call); });
+}
+
+std::optional<EntryReply> WebEntry::Dispatch(const CallPtr& call_ptr) {
+  Call& call = *call_ptr;
+  const EntryRequest& request = call.request;
   FormFields fields;
   std::string error;
   if (!DecodeForm(request.query, fields, error)) {
@@ -136,20 +158,19 @@ EntryReply WebEntry::Dispatch(const EntryRequest& request, Call& call) {
   }
   call.api = *call.Field("api");
   call.method = *call.Field("method");
-  AccessRecord& access = CurrentAccess();
-  access.api = call.api;
-  access.method = call.method;
+  call.access.api = call.api;
+  call.access.method = call.method;
   if (!ParseVersion(*call.Field("version"), call.version)) {
     return Error(KOVA::kAPIErrorBadParameter, "version must be a whole number");
   }
   if (call.api == kInfoApi || call.api == kAuthApi) {
     if (call.version != 1) return Error(KOVA::kAPIErrorBadVersion, "no such version");
     if (call.api == kInfoApi && call.method == "query") return Info();
-    if (call.api == kAuthApi && call.method == "login") return SignIn(request, call);
-    if (call.api == kAuthApi && call.method == "logout") return SignOut(request, call);
+    if (call.api == kAuthApi && call.method == "login") return SignIn(call_ptr);
+    if (call.api == kAuthApi && call.method == "logout") return SignOut(call);
     return Error(KOVA::kAPIErrorNoSuchMethod, "no such method");
   }
-  return RunModule(request, call);
+  return RunModule(call_ptr);
 }
 
 EntryReply WebEntry::Info() const {
@@ -157,7 +178,7 @@ EntryReply WebEntry::Info() const {
   std::map<std::string, std::map<int, std::vector<std::string>>> apis;
   apis[kAuthApi][1] = {"login", "logout"};
   apis[kInfoApi][1] = {"query"};
-  for (const Json::Value& row : *runner_.Methods()) {
+  for (const Json::Value& row : *runners_.Methods()) {
     apis[row["api"].asString()][row["version"].asInt()].push_back(row["method"].asString());
   }
   Json::Value list(Json::arrayValue);
@@ -180,7 +201,9 @@ EntryReply WebEntry::Info() const {
   return Json(SuccessEnvelope(data));
 }
 
-EntryReply WebEntry::SignIn(const EntryRequest& request, const Call& call) {
+std::optional<EntryReply> WebEntry::SignIn(const CallPtr& call_ptr) {
+  Call& call = *call_ptr;
+  const EntryRequest& request = call.request;
   if (request.http_method != "POST") {
     return Error(KOVA::kAPIErrorBadParameter, "sign in with a POST request");
   }
@@ -190,8 +213,8 @@ EntryReply WebEntry::SignIn(const EntryRequest& request, const Call& call) {
       account->size() > 64 || password->size() > kMaxPassword) {
     return Error(KOVA::kAPIErrorBadParameter, "give an account and a password");
   }
-  CurrentAccess().user = *account;
-  const std::vector<std::string> keys = {"account:" + *account, "address:" + request.remote_addr};
+  call.access.user = *account;
+  std::vector<std::string> keys = {"account:" + *account, "address:" + request.remote_addr};
   const TimePoint now = std::chrono::steady_clock::now();
   if (const int wait = throttle_.Reserve(keys, now); wait > 0) {
     Json::Value errors;
@@ -201,6 +224,15 @@ EntryReply WebEntry::SignIn(const EntryRequest& request, const Call& call) {
     reply.headers.emplace_back("Retry-After", std::to_string(wait));
     return reply;
   }
+  run_blocking_([this, call_ptr, keys = std::move(keys)] {
+    AnswerWith(call_ptr, [&] { return std::optional(CheckPassword(*call_ptr, keys)); });
+  });
+  return std::nullopt;
+}
+
+EntryReply WebEntry::CheckPassword(Call& call, const std::vector<std::string>& keys) {
+  const std::string* account = call.Field("account");
+  const std::string* password = call.Field("password");
   bool admin = false;
   const int checked = check_password_(*account, *password, admin);
   if (checked < 0) {
@@ -212,7 +244,7 @@ EntryReply WebEntry::SignIn(const EntryRequest& request, const Call& call) {
   throttle_.Succeeded(keys);
   Session session;
   const std::string sid =
-      sessions_.Create(*account, admin, Language(call.Field("lang"), request.accept_language),
+      sessions_.Create(*account, admin, Language(call.Field("lang"), call.request.accept_language),
                        std::chrono::steady_clock::now(), session);
   Json::Value data;
   data["sid"] = sid;
@@ -224,19 +256,19 @@ EntryReply WebEntry::SignIn(const EntryRequest& request, const Call& call) {
   return reply;
 }
 
-EntryReply WebEntry::SignOut(const EntryRequest& request, const Call& call) {
+EntryReply WebEntry::SignOut(Call& call) {
   std::string sid;
   Session session;
   EntryReply refused;
-  if (!FindSession(request, call, sid, session, refused)) return refused;
+  if (!FindSession(call, sid, session, refused)) return refused;
   sessions_.Remove(sid);
   EntryReply reply = Json(SuccessEnvelope(Json::Value()));
   reply.headers.emplace_back("Set-Cookie", SessionCookie(""));
   return reply;
 }
 
-bool WebEntry::FindSession(const EntryRequest& request, const Call& call, std::string& sid,
-                           Session& session, EntryReply& refused) {
+bool WebEntry::FindSession(Call& call, std::string& sid, Session& session, EntryReply& refused) {
+  const EntryRequest& request = call.request;
   const std::string* sid_param = call.Field("_sid");
   const bool by_cookie = sid_param == nullptr;
   sid = by_cookie ? CookieValue(request.cookie, kSessionCookie) : *sid_param;
@@ -250,7 +282,7 @@ bool WebEntry::FindSession(const EntryRequest& request, const Call& call, std::s
     refused = Error(KOVA::kAPIErrorNoSession, "the session is unknown or has expired");
     return false;
   }
-  CurrentAccess().user = found->account;
+  call.access.user = found->account;
   if (by_cookie) {
     const std::string* token_param = call.Field("_token");
     const std::string token = !request.token_header.empty() ? request.token_header
@@ -266,10 +298,10 @@ bool WebEntry::FindSession(const EntryRequest& request, const Call& call, std::s
   return true;
 }
 
-EntryReply WebEntry::RunModule(const EntryRequest& request, const Call& call) {
-  const std::shared_ptr<const Json::Value> methods = runner_.Methods();
-  // Before any runner started, the runner itself tells of missing methods.
-  bool api_known = methods->empty(), version_known = api_known, method_known = api_known;
+std::optional<EntryReply> WebEntry::RunModule(const CallPtr& call_ptr) {
+  Call& call = *call_ptr;
+  const std::shared_ptr<const Json::Value> methods = runners_.Methods();
+  bool api_known = false, version_known = false, method_known = false;
   for (const Json::Value& row : *methods) {
     if (row["api"].asString() != call.api) continue;
     api_known = true;
@@ -284,7 +316,7 @@ EntryReply WebEntry::RunModule(const EntryRequest& request, const Call& call) {
   std::string sid;
   Session session;
   EntryReply refused;
-  if (!FindSession(request, call, sid, session, refused)) return refused;
+  if (!FindSession(call, sid, session, refused)) return refused;
   if (!session.admin) return Error(KOVA::kAPIErrorNotPermitted, "for administrators only");
 
   RunnerCall runner_call{call.api,        call.version,
@@ -297,21 +329,36 @@ EntryReply WebEntry::RunModule(const EntryRequest& request, const Call& call) {
                    "parameter " + name + " nests deeper than " + std::to_string(kMaxParamDepth));
     }
   }
-  RunnerAnswer answer;
-  std::string error;
-  if (!runner_.Call(runner_call, answer, error)) {
+  runners_.Submit(
+      runner_call, [call_ptr](CallResult result, RunnerAnswer answer, const std::string& error) {
+        AnswerWith(call_ptr, [&] {
+          return std::optional(ModuleReply(*call_ptr, result, std::move(answer), error));
+        });
+      });
+  return std::nullopt;
+}
+
+EntryReply WebEntry::ModuleReply(const Call& call, CallResult result, RunnerAnswer answer,
+                                 const std::string& error) {
+  if (result == CallResult::kBusy) {
+    EntryReply reply = Error(KOVA::kAPIErrorUnknown, error + "; try again shortly", 503);
+    reply.headers.emplace_back("Retry-After", "1");
+    return reply;
+  }
+  if (result != CallResult::kAnswered) {
     return Error(KOVA::kAPIErrorUnknown, error + "; the call was abandoned");
   }
-  CurrentAccess().code = answer.code;
   EntryReply reply;
+  reply.access.code = answer.code;
   if (!answer.raw) {
     reply.body = std::move(answer.body);
     reply.headers.emplace_back("Cache-Control", "no-store");
     return reply;
   }
   CgiReply cgi;
-  if (!ParseCgiOutput(answer.body, cgi, error)) {
-    HostLog("%s v%d %s: %s", call.api.c_str(), call.version, call.method.c_str(), error.c_str());
+  std::string fault;
+  if (!ParseCgiOutput(answer.body, cgi, fault)) {
+    HostLog("%s v%d %s: %s", call.api.c_str(), call.version, call.method.c_str(), fault.c_str());
     return Error(KOVA::kAPIErrorUnknown, "the handler's output is malformed");
   }
   reply.status = cgi.status;

@@ -5,12 +5,15 @@
 #define KOVA_HOST_WEB_ENTRY_H_
 
 #include <functional>
+#include <memory>
+#include <optional>
 #include <string>
 #include <utility>
 #include <vector>
 
+#include "host/access_log.h"
 #include "host/params.h"
-#include "host/runner_client.h"
+#include "host/runner_pool.h"
 #include "host/sessions.h"
 
 namespace kova_host {
@@ -39,7 +42,14 @@ struct EntryReply {
   std::string content_type = "application/json; charset=utf-8";
   std::string body;
   std::vector<std::pair<std::string, std::string>> headers;
+  AccessRecord access;  // what the access log tells of the call
 };
+
+// Receives the reply to a request.
+using ReplyDone = std::function<void(EntryReply reply)>;
+// Runs work that blocks (a password check) away from the threads that serve
+// connections.
+using BlockingRunner = std::function<void(std::function<void()> work)>;
 
 // Checks a password: 1 when it is the account's (`admin` set), 0 when not, -1 on failure.
 using PasswordCheck =
@@ -47,31 +57,42 @@ using PasswordCheck =
 
 class WebEntry {
  public:
-  WebEntry(RunnerClient& runner, PasswordCheck check_password, SessionStore& sessions,
-           LoginThrottle& throttle)
-      : runner_(runner),
+  WebEntry(RunnerPool& runners, PasswordCheck check_password, SessionStore& sessions,
+           LoginThrottle& throttle, BlockingRunner run_blocking)
+      : runners_(runners),
         check_password_(std::move(check_password)),
         sessions_(sessions),
-        throttle_(throttle) {}
+        throttle_(throttle),
+        run_blocking_(std::move(run_blocking)) {}
 
+  // Answers `request` through `done`, exactly once: before returning, or later
+  // on another thread (a module runner's dispatcher, or the blocking runner's).
   // Never throws; every failure is an answer.
-  EntryReply Handle(const EntryRequest& request);
+  void Handle(EntryRequest request, ReplyDone done);
 
  private:
   struct Call;
-  EntryReply Dispatch(const EntryRequest& request, Call& call);
+  using CallPtr = std::shared_ptr<Call>;
+  // The reply, or nothing when the call is answered later.
+  std::optional<EntryReply> Dispatch(const CallPtr& call);
   EntryReply Info() const;
-  EntryReply SignIn(const EntryRequest& request, const Call& call);
-  EntryReply SignOut(const EntryRequest& request, const Call& call);
-  EntryReply RunModule(const EntryRequest& request, const Call& call);
+  std::optional<EntryReply> SignIn(const CallPtr& call);
+  EntryReply CheckPassword(Call& call, const std::vector<std::string>& keys);
+  EntryReply SignOut(Call& call);
+  std::optional<EntryReply> RunModule(const CallPtr& call);
+  static EntryReply ModuleReply(const Call& call, CallResult result, RunnerAnswer answer,
+                                const std::string& error);
   // The call's session, or the error reply in `refused`.
-  bool FindSession(const EntryRequest& request, const Call& call, std::string& sid,
-                   Session& session, EntryReply& refused);
+  bool FindSession(Call& call, std::string& sid, Session& session, EntryReply& refused);
+  // Answers with `make`'s reply, or with an error when it throws.
+  template <typename Make>
+  static void AnswerWith(const CallPtr& call, Make make);
 
-  RunnerClient& runner_;
+  RunnerPool& runners_;
   PasswordCheck check_password_;
   SessionStore& sessions_;
   LoginThrottle& throttle_;
+  BlockingRunner run_blocking_;
 };
 
 }  // namespace kova_host

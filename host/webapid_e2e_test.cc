@@ -331,7 +331,7 @@ TEST_F(WebApidTest, AModuleThatCrashesOrHangsDoesNotTakeTheHostDown) {
   std::vector<std::thread> waiting;
   for (int i = 0; i < 3; ++i) {
     waiting.emplace_back(
-        [&] { EXPECT_TRUE(Call(kSetting, "get", {}, sid).json["success"].asBool()); });
+        [&] { EXPECT_TRUE(Call("KOVA.Test.Crash", "echo", {}, sid).json["success"].asBool()); });
   }
   crash.join();
   for (std::thread& thread : waiting) thread.join();

@@ -35,10 +35,12 @@ samples=$(grep -o '"times":\[[^]]*\]' <<<"$answer" | awk 'NR == 1' | tr ',' '\n'
 echo "an answer holds 20 series of $samples samples ($(wc -c <<<"$answer") bytes)"
 
 echo "wrk: 1 connection, ${seconds} s each"
+wrk_header
 wrk_run KOVA.ResourceMonitor.Setting/get 1 "$seconds" \
-  "$url?api=KOVA.ResourceMonitor.Setting&version=1&method=get&_sid=$sid"
+  "$url?api=KOVA.ResourceMonitor.Setting&version=1&method=get&_sid=$sid" -s bench/count_failures.lua
 baseline=$p50_ms
-KOVA_PATH=$path wrk_run "KOVA.ResourceMonitor.Usage/realtime" 1 "$seconds" "${url%/webapi/entry.cgi}" \
-  -s bench/usage_realtime.lua
+# Each request asks for the last 60 s.
+KOVA_SINCE=60 wrk_run "KOVA.ResourceMonitor.Usage/realtime" 1 "$seconds" \
+  "${url%/webapi/entry.cgi}$path" -s bench/count_failures.lua
 awk -v a="$p50_ms" -v b="$baseline" \
   'BEGIN {printf "p50 Usage/realtime %.2f ms (target under 5 ms) : Setting/get %.2f ms = %.2f\n", a, b, a / b}'

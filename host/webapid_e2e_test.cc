@@ -6,13 +6,16 @@
 #include <httplib.h>
 #include <pwd.h>
 #include <signal.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <mutex>
 #include <regex>
 #include <string>
 #include <thread>
@@ -372,6 +375,103 @@ TEST_F(WebApidTest, AModuleThatCrashesOrHangsDoesNotTakeTheHostDown) {
             "ger");
   EXPECT_EQ(Call("KOVA.Test.Crash", "echo", {{"value", "csv"}}, sid).json["data"]["value"], "csv");
   EXPECT_THAT(host_->Log(), HasSubstr("killed by signal 6"));
+}
+
+TEST_F(WebApidTest, ModulesRunApartAndAFullQueueIsRefusedUntilItDrains) {
+  AddModule(KOVA_CRASH_MODULE_PATH);
+  Start({"--max-waiting", "1"});
+  const std::string sid = Sid("admin", kAdminPassword);
+  std::mutex mutex;
+  std::vector<std::string> finished;
+  const auto note = [&](const std::string& what) {
+    std::lock_guard lock(mutex);
+    finished.push_back(what);
+  };
+  std::thread slow([&] {
+    EXPECT_TRUE(Call("KOVA.Test.Crash", "sleep", {{"seconds", "3"}}, sid).json["success"].asBool());
+    note("slow");
+  });
+  std::this_thread::sleep_for(std::chrono::milliseconds(300));
+  // Another module's runner answers while the slow call runs.
+  EXPECT_TRUE(Call(kSetting, "get", {}, sid).json["success"].asBool());
+  note("setting");
+  // Behind the slow call, one call may wait in the queue (and one in the
+  // runner's socket); the others are refused at once.
+  std::vector<Reply> replies(4);
+  std::vector<std::thread> behind;
+  for (Reply& reply : replies) {
+    behind.emplace_back([&] { reply = Call("KOVA.Test.Crash", "echo", {}, sid); });
+  }
+  for (std::thread& thread : behind) thread.join();
+  slow.join();
+  EXPECT_EQ(finished, (std::vector<std::string>{"setting", "slow"}));
+  int refused = 0;
+  for (const Reply& reply : replies) {
+    if (reply.status != 503) {
+      EXPECT_TRUE(reply.json["success"].asBool()) << reply.body;
+      continue;
+    }
+    ++refused;
+    EXPECT_EQ(Code(reply), 100);
+    EXPECT_THAT(reply.json["error"]["errors"]["reason"].asString(),
+                HasSubstr("too many calls wait for the module"));
+    EXPECT_EQ(reply.headers.find("Retry-After")->second, "1");
+  }
+  EXPECT_GE(refused, 1);
+  EXPECT_TRUE(Call("KOVA.Test.Crash", "echo", {}, sid).json["success"].asBool());
+}
+
+TEST_F(WebApidTest, ACallKilledInTheMiddleLeavesNoTemporaryFileBehind) {
+  if (geteuid() != 0) GTEST_SKIP() << "NOT RUN: a runner's own temporary folder needs root";
+  AddModule(KOVA_CRASH_MODULE_PATH);
+  root_.Write("/tmp/kovalog-of-someone-else", "keep me");
+  Start();
+  const std::string sid = Sid("admin", kAdminPassword);
+  EXPECT_EQ(Code(Call("KOVA.Test.Crash", "leave_temp", {}, sid)), 100);
+  EXPECT_TRUE(Call("KOVA.Test.Crash", "echo", {}, sid).json["success"].asBool());
+  const auto left = [&] {
+    std::vector<std::string> names;
+    for (const auto& entry : std::filesystem::directory_iterator(root_.Path("/tmp"))) {
+      names.push_back(entry.path().filename().string());
+    }
+    std::sort(names.begin(), names.end());
+    return names;
+  };
+  // Beside the running runners' own folders, only the other file is there.
+  std::vector<std::string> running = left();
+  std::erase_if(running,
+                [](const std::string& name) { return name.rfind("kova-webapid-", 0) == 0; });
+  EXPECT_EQ(running, std::vector<std::string>{"kovalog-of-someone-else"});
+  host_.reset();  // the runners' folders go with them
+  EXPECT_EQ(left(), std::vector<std::string>{"kovalog-of-someone-else"});
+}
+
+TEST_F(WebApidTest, RefusesToStartWithAModulesFolderItCannotRead) {
+  if (geteuid() != 0) GTEST_SKIP() << "NOT RUN: needs root to give root up";
+  chmod(root_.Path("/modules").c_str(), 0700);
+  const std::string log = root_.Path("/refused.log");
+  const pid_t pid = fork();
+  if (pid == 0) {
+    freopen(log.c_str(), "w", stderr);
+    execl(KOVA_WEBAPID_PATH, KOVA_WEBAPID_PATH, "--port", "0", "--modules",
+          root_.Path("/modules").c_str(), static_cast<char*>(nullptr));
+    _exit(127);
+  }
+  int status = 0;
+  for (int i = 0; i < 200 && waitpid(pid, &status, WNOHANG) == 0; ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+  }
+  if (waitpid(pid, &status, WNOHANG) == 0) {
+    kill(pid, SIGKILL);
+    waitpid(pid, &status, 0);
+    ADD_FAILURE() << "the host went on serving";
+  }
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) != 0);
+  std::ifstream in(log);
+  const std::string text(std::istreambuf_iterator<char>(in), {});
+  EXPECT_THAT(text, HasSubstr("cannot open the modules folder " + root_.Path("/modules") +
+                              ": Permission denied"));
+  EXPECT_THAT(text, Not(HasSubstr("listening")));
 }
 
 TEST_F(WebApidTest, IdsThatAModuleLeavesRaisedDoNotReachTheNextCall) {

@@ -1,5 +1,5 @@
 // A web-API module for the host's tests, "KOVA.Test.Crash": it aborts, hangs,
-// throws or writes its own output when asked to.
+// throws, leaves a temporary file or writes its own output when asked to.
 
 #include <unistd.h>
 
@@ -7,6 +7,7 @@
 #include <cstdlib>
 #include <stdexcept>
 
+#include "kova/conf.h"
 #include "kova/webapi.h"
 
 namespace {
@@ -44,6 +45,13 @@ void Garbage(KOVA::APIRequest*, KOVA::APIResponse* response) {
 
 void Throw(KOVA::APIRequest*, KOVA::APIResponse*) { throw std::runtime_error("on purpose"); }
 
+// Makes a temporary file the way the log reader does, then aborts.
+void LeaveTemp(KOVA::APIRequest*, KOVA::APIResponse*) {
+  char name[4096];
+  QLIBCFileITmpName("/tmp/kovalog", name, sizeof(name));
+  abort();
+}
+
 int Refuse(KOVA::APIRequest*) { return 0; }
 
 }  // namespace
@@ -51,10 +59,15 @@ int Refuse(KOVA::APIRequest*) { return 0; }
 extern "C" {
 
 __attribute__((visibility("default"))) APITableEntry gTable[] = {
-    {"KOVA.Test.Crash", 1, "abort", Abort},     {"KOVA.Test.Crash", 1, "sleep", Sleep},
-    {"KOVA.Test.Crash", 1, "echo", Echo},       {"KOVA.Test.Crash", 1, "raw", Raw},
-    {"KOVA.Test.Crash", 1, "garbage", Garbage}, {"KOVA.Test.Crash", 1, "throw", Throw},
-    {"KOVA.Test.Crash", 1, "refused", Echo},    {nullptr, 0, nullptr, nullptr},
+    {"KOVA.Test.Crash", 1, "abort", Abort},
+    {"KOVA.Test.Crash", 1, "sleep", Sleep},
+    {"KOVA.Test.Crash", 1, "echo", Echo},
+    {"KOVA.Test.Crash", 1, "raw", Raw},
+    {"KOVA.Test.Crash", 1, "garbage", Garbage},
+    {"KOVA.Test.Crash", 1, "throw", Throw},
+    {"KOVA.Test.Crash", 1, "refused", Echo},
+    {"KOVA.Test.Crash", 1, "leave_temp", LeaveTemp},
+    {nullptr, 0, nullptr, nullptr},
 };
 
 __attribute__((visibility("default"))) APICheckEntry gCheckTable[] = {

@@ -1,7 +1,10 @@
 #include "host/runner_pool.h"
 
+#include <set>
+
 #include "host/host_log.h"
 #include "host/module_loader.h"
+#include "kova/webapi.h"
 
 namespace kova_host {
 
@@ -31,6 +34,10 @@ RunnerPool::~RunnerPool() = default;
 bool RunnerPool::Start(const std::string& modules_dir, std::string& error) {
   std::vector<std::string> files;
   if (!ListModules(modules_dir, files, error)) return false;
+  // The platform's own APIs, which every runner serves beside its module's.
+  std::set<std::string> platform_apis;
+  for (const Json::Value& row : KOVA::APIRunner::List())
+    platform_apis.insert(row["api"].asString());
   Json::Value methods(Json::arrayValue);
   for (const std::string& file : files) {
     auto module = std::make_unique<Module>(monitor_, file, call_timeout_, max_waiting_);
@@ -47,7 +54,7 @@ bool RunnerPool::Start(const std::string& modules_dir, std::string& error) {
       if (!taken.count(api)) taken[api] = by_api_.emplace(api, module.get()).second;
       if (taken[api]) {
         methods.append(row);
-      } else {
+      } else if (platform_apis.count(api) == 0) {
         HostLog("module %s: %s is served by another module; left out", file.c_str(), api.c_str());
       }
     }

@@ -185,7 +185,7 @@ class Monitor {
     return sent;
   }
 
-  void StopRunner(const std::string& module) {
+  void StopRunner(const std::string& module) {  // not a key of runners_: erased below
     const auto found = runners_.find(module);
     if (found == runners_.end()) return;
     // A runner that is ending already keeps the status it ends with.
@@ -235,7 +235,7 @@ class Monitor {
 
   void Shutdown() {
     shutdown(control_, SHUT_RDWR);  // requests of the front-end fail now instead of waiting
-    while (!runners_.empty()) StopRunner(runners_.begin()->first);
+    while (!runners_.empty()) StopRunner(std::string(runners_.begin()->first));
     if (!front_end_ended_) {
       kill(front_end_, SIGTERM);
       for (int i = 0; i < 50 && !front_end_ended_; ++i) {

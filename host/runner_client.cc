@@ -93,6 +93,7 @@ bool RunnerClient::StartRunner(std::string& error) {
 void RunnerClient::StopRunner() {
   if (fd_ >= 0) close(fd_);
   fd_ = -1;
+  write_failed_ = false;
   reader_.reset();
   launcher_.Stop();
 }
@@ -154,7 +155,7 @@ bool RunnerClient::SendWaiting() {
     Pending* next = nullptr;
     {
       std::lock_guard lock(mutex_);
-      if (queue_.empty() || sent_.size() > 1) return true;
+      if (queue_.empty() || sent_.size() > 1 || write_failed_) return true;
       if (!sent_.empty() && queue_.front()->message.size() > kMaxQueuedCall) return true;
       next = queue_.front();
       queue_.pop_front();
@@ -165,6 +166,12 @@ bool RunnerClient::SendWaiting() {
     }
     sent_.push_back(next);
     const IoResult sent = WriteFrame(fd_, next->message, running_since_ + call_timeout_);
+    if (sent == IoResult::kClosed || sent == IoResult::kError) {
+      // The runner is gone; what it said before it went is still to be read,
+      // which tells whether it took the first call.
+      write_failed_ = true;
+      return true;
+    }
     if (sent != IoResult::kOk) {
       Abandon(sent);
       return false;

@@ -94,6 +94,7 @@ class RunnerClient {
   std::unique_ptr<FrameReader> reader_;
   std::deque<Pending*> sent_;  // sent calls, the first one running
   bool taken_ = false;         // the runner has taken the first sent call
+  bool write_failed_ = false;  // the runner's socket takes no more calls
   Clock::time_point running_since_;
 
   mutable std::mutex methods_mutex_;

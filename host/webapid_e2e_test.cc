@@ -16,6 +16,7 @@
 #include <filesystem>
 #include <fstream>
 #include <mutex>
+#include <optional>
 #include <regex>
 #include <string>
 #include <thread>
@@ -603,22 +604,27 @@ TEST_F(WebApidTest, IdleAndSlowClientsDoNotHoldUpOtherCalls) {
 
 TEST_F(WebApidTest, ClientsThatSendTooSlowlyOrIdleAreCutOff) {
   Start({"--header-timeout", "2", "--body-timeout", "3", "--keepalive-timeout", "6"});
+  using std::chrono::seconds;
   const struct {
     const char* what;
     std::string first;  // sent at once
-    std::string drip;   // sent every half second after
+    std::string drip;   // sent again about every second after
     bool answered;      // `first` is a whole request
+    seconds open;       // it stays open at least this long: its own limit, less a second
   } cases[] = {
-      {"a connection that sends nothing", "", "", false},
-      {"a header line every half second", "GET / HTTP/1.1\r\n", "X-Slow: 1\r\n", false},
-      {"a byte of the request line every half second", "G", "E", false},
+      {"a connection that sends nothing", "", "", false, seconds(1)},
+      {"a header line about every second", "GET / HTTP/1.1\r\n", "X-Slow: 1\r\n", false,
+       seconds(1)},
+      {"a byte of the target about every second", "GET /", "a", false, seconds(1)},
       {"a body that trickles in",
        "POST /webapi/entry.cgi HTTP/1.1\r\nHost: x\r\n"
        "Content-Type: application/x-www-form-urlencoded\r\nContent-Length: 1000\r\n\r\n",
-       "a", false},
-      {"a kept-alive connection left idle", kInfoRequest, "", true},
+       "a", false, seconds(2)},
+      // Past its header time too: an idle connection waits for its keep-alive time.
+      {"a kept-alive connection left idle", kInfoRequest, "", true, seconds(5)},
   };
   std::vector<kova_test::RawConnection> clients;
+  std::vector<std::chrono::steady_clock::time_point> since;
   for (const auto& c : cases) {
     clients.emplace_back(host_->port());
     ASSERT_TRUE(clients.back().ok());
@@ -627,30 +633,30 @@ TEST_F(WebApidTest, ClientsThatSendTooSlowlyOrIdleAreCutOff) {
       // Answered twice on the same connection: it is kept alive.
       for (int i = 0; i < 2; ++i) {
         if (i > 0) clients.back().Send(c.first);
-        EXPECT_THAT(clients.back().ReadAnswer(std::chrono::seconds(30)),
-                    ::testing::StartsWith("HTTP/1.1 200 "))
+        EXPECT_THAT(clients.back().ReadAnswer(seconds(30)), ::testing::StartsWith("HTTP/1.1 200 "))
             << c.what;
       }
     }
+    since.push_back(std::chrono::steady_clock::now());
   }
-  std::vector<bool> closed(clients.size(), false);
+  // Each close is seen within a tenth of a second or so, never before it happened.
+  std::vector<std::optional<std::chrono::steady_clock::duration>> open_for(clients.size());
   const auto start = std::chrono::steady_clock::now();
-  bool checked_idle = false;
-  while (std::chrono::steady_clock::now() - start < std::chrono::seconds(40)) {
+  while (std::chrono::steady_clock::now() - start < seconds(40) &&
+         std::find(open_for.begin(), open_for.end(), std::nullopt) != open_for.end()) {
     for (size_t i = 0; i < clients.size(); ++i) {
-      if (closed[i]) continue;
+      if (open_for[i]) continue;
       if (!cases[i].drip.empty()) clients[i].Send(cases[i].drip);
-      closed[i] = clients[i].ClosedWithin(std::chrono::milliseconds(100));
+      if (clients[i].ClosedWithin(std::chrono::milliseconds(100))) {
+        open_for[i] = std::chrono::steady_clock::now() - since[i];
+      }
     }
-    // Past the header time, the idle connection waits for its keep-alive time.
-    if (!checked_idle && std::chrono::steady_clock::now() - start > std::chrono::seconds(3)) {
-      EXPECT_FALSE(closed.back()) << "closed before its keep-alive time";
-      checked_idle = true;
-    }
-    if (std::find(closed.begin(), closed.end(), false) == closed.end()) break;
     std::this_thread::sleep_for(std::chrono::milliseconds(400));
   }
-  for (size_t i = 0; i < clients.size(); ++i) EXPECT_TRUE(closed[i]) << cases[i].what;
+  for (size_t i = 0; i < clients.size(); ++i) {
+    ASSERT_TRUE(open_for[i]) << cases[i].what << ": never closed";
+    EXPECT_GE(*open_for[i], cases[i].open) << cases[i].what << ": closed too early";
+  }
 }
 
 TEST_F(WebApidTest, ConnectionsOverACapAreRefusedUntilSomeClose) {

@@ -16,6 +16,7 @@
 #include <filesystem>
 #include <fstream>
 #include <mutex>
+#include <optional>
 #include <regex>
 #include <string>
 #include <thread>
@@ -23,6 +24,7 @@
 
 #include "test_support/daemon_service.h"
 #include "test_support/host_call.h"
+#include "test_support/raw_http.h"
 #include "test_support/test_root.h"
 #include "test_support/webapid.h"
 
@@ -264,6 +266,10 @@ TEST_F(WebApidTest, EveryMethodNeedsASignedInAdministrator) {
        "",
        {{"Cookie", cookie}, {"X-KOVA-Token", "x" + token}},
        107},
+      {"the cookie cut by an encoded NUL",
+       "",
+       {{"Cookie", cookie + "%00junk"}, {"X-KOVA-Token", token}},
+       106},
       {"an expired session", expired, {}, 106},
       {"a user who is no administrator", guest, {}, 105},
   };
@@ -551,6 +557,190 @@ TEST_F(WebApidTest, RefusesBadInputWithAClearError) {
   EXPECT_TRUE(escaped.json["success"].asBool()) << escaped.status << " " << escaped.body;
   EXPECT_TRUE(Call(kSetting, "get", {}, sid).json["success"].asBool());  // still serving
   EXPECT_THAT(host_->Log(), Not(HasSubstr("malformed call")));
+}
+
+// A request for the host's own API, which the front-end answers alone.
+constexpr char kInfoRequest[] =
+    "GET /webapi/entry.cgi?api=KOVA.API.Info&version=1&method=query HTTP/1.1\r\n"
+    "Host: 127.0.0.1\r\n\r\n";
+
+TEST_F(WebApidTest, IdleAndSlowClientsDoNotHoldUpOtherCalls) {
+  // A header time longer than the test, so that every client stays connected.
+  Start({"--header-timeout", "120", "--max-per-address", "1000"});
+  const std::string sid = Sid("admin", kAdminPassword);
+  ASSERT_FALSE(sid.empty());
+  std::vector<kova_test::RawConnection> idle, slow;
+  for (int i = 0; i < 200; ++i) idle.emplace_back(host_->port());
+  for (int i = 0; i < 50; ++i) slow.emplace_back(host_->port());
+  // Each slow client sends one byte of its request a second.
+  std::atomic<bool> stop = false;
+  std::thread trickle([&] {
+    const std::string request = kInfoRequest;
+    for (size_t i = 0; i < request.size() && !stop; ++i) {
+      for (const kova_test::RawConnection& client : slow) client.Send(request.substr(i, 1));
+      for (int tick = 0; tick < 10 && !stop; ++tick) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(100));
+      }
+    }
+  });
+  std::this_thread::sleep_for(std::chrono::seconds(2));
+  for (int i = 0; i < 3; ++i) {
+    const Reply reply = Call(kSetting, "get", {}, sid);
+    EXPECT_TRUE(reply.json["success"].asBool()) << reply.status << " " << reply.body;
+    if (!reply.json["success"].asBool()) break;
+  }
+  httplib::Client client("127.0.0.1", host_->port());
+  client.set_read_timeout(std::chrono::seconds(30));
+  const httplib::Result page = client.Get("/");
+  EXPECT_TRUE(page && page->status == 200);
+  int open = 0;
+  for (const auto* clients : {&idle, &slow}) {
+    for (const kova_test::RawConnection& connection : *clients) open += connection.Open();
+  }
+  EXPECT_EQ(open, 250);
+  stop = true;
+  trickle.join();
+}
+
+TEST_F(WebApidTest, ClientsThatSendTooSlowlyOrIdleAreCutOff) {
+  Start({"--header-timeout", "2", "--body-timeout", "3", "--keepalive-timeout", "6"});
+  using std::chrono::seconds;
+  const struct {
+    const char* what;
+    std::string first;  // sent at once
+    std::string drip;   // sent again about every second after
+    bool answered;      // `first` is a whole request
+    seconds open;       // it stays open at least this long: its own limit, less a second
+  } cases[] = {
+      {"a connection that sends nothing", "", "", false, seconds(1)},
+      {"a header line about every second", "GET / HTTP/1.1\r\n", "X-Slow: 1\r\n", false,
+       seconds(1)},
+      {"a byte of the target about every second", "GET /", "a", false, seconds(1)},
+      {"a body that trickles in",
+       "POST /webapi/entry.cgi HTTP/1.1\r\nHost: x\r\n"
+       "Content-Type: application/x-www-form-urlencoded\r\nContent-Length: 1000\r\n\r\n",
+       "a", false, seconds(2)},
+      // Past its header time too: an idle connection waits for its keep-alive time.
+      {"a kept-alive connection left idle", kInfoRequest, "", true, seconds(5)},
+  };
+  std::vector<kova_test::RawConnection> clients;
+  std::vector<std::chrono::steady_clock::time_point> since;
+  for (const auto& c : cases) {
+    clients.emplace_back(host_->port());
+    ASSERT_TRUE(clients.back().ok());
+    clients.back().Send(c.first);
+    if (c.answered) {
+      // Answered twice on the same connection: it is kept alive.
+      for (int i = 0; i < 2; ++i) {
+        if (i > 0) clients.back().Send(c.first);
+        EXPECT_THAT(clients.back().ReadAnswer(seconds(30)), ::testing::StartsWith("HTTP/1.1 200 "))
+            << c.what;
+      }
+    }
+    since.push_back(std::chrono::steady_clock::now());
+  }
+  // Each close is seen within a tenth of a second or so, never before it happened.
+  std::vector<std::optional<std::chrono::steady_clock::duration>> open_for(clients.size());
+  const auto start = std::chrono::steady_clock::now();
+  while (std::chrono::steady_clock::now() - start < seconds(40) &&
+         std::find(open_for.begin(), open_for.end(), std::nullopt) != open_for.end()) {
+    for (size_t i = 0; i < clients.size(); ++i) {
+      if (open_for[i]) continue;
+      if (!cases[i].drip.empty()) clients[i].Send(cases[i].drip);
+      if (clients[i].ClosedWithin(std::chrono::milliseconds(100))) {
+        open_for[i] = std::chrono::steady_clock::now() - since[i];
+      }
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(400));
+  }
+  for (size_t i = 0; i < clients.size(); ++i) {
+    ASSERT_TRUE(open_for[i]) << cases[i].what << ": never closed";
+    EXPECT_GE(*open_for[i], cases[i].open) << cases[i].what << ": closed too early";
+  }
+}
+
+TEST_F(WebApidTest, ConnectionsOverACapAreRefusedUntilSomeClose) {
+  const struct {
+    const char* option;
+    const char* reason;
+  } caps[] = {
+      {"--max-per-address", "too many connections from your address"},
+      {"--max-connections", "the host has too many connections"},
+  };
+  for (const auto& cap : caps) {
+    Start({cap.option, "4", "--header-timeout", "120"});
+    std::vector<kova_test::RawConnection> held;
+    for (int i = 0; i < 4; ++i) held.emplace_back(host_->port());
+    kova_test::RawConnection extra(host_->port());
+    extra.Send(kInfoRequest);
+    std::string answer;
+    EXPECT_TRUE(extra.ClosedWithin(std::chrono::seconds(30), &answer)) << cap.option;
+    EXPECT_THAT(answer, ::testing::StartsWith("HTTP/1.1 503 ")) << cap.option;
+    EXPECT_THAT(answer, HasSubstr("\r\nConnection: close\r\n")) << cap.option;
+    EXPECT_THAT(answer, ::testing::EndsWith("\r\n\r\n"
+                                            R"({"error":{"code":100,"errors":{"reason":")" +
+                                            std::string(cap.reason) + R"("}},"success":false})"))
+        << cap.option;
+    EXPECT_THAT(answer, HasSubstr("\r\nX-Content-Type-Options: nosniff\r\n")) << cap.option;
+
+    // Once two close, the host serves again.
+    held.erase(held.begin() + 2, held.end());
+    bool served = false;
+    const auto start = std::chrono::steady_clock::now();
+    while (!served && std::chrono::steady_clock::now() - start < std::chrono::seconds(30)) {
+      kova_test::RawConnection client(host_->port());
+      client.Send(kInfoRequest);
+      served = client.ReadAnswer(std::chrono::seconds(10)).rfind("HTTP/1.1 200 ", 0) == 0;
+      if (!served) std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    }
+    EXPECT_TRUE(served) << cap.option;
+    host_.reset();
+  }
+}
+
+TEST_F(WebApidTest, StaticFilesAreServedFromInsideTheirFolderOnly) {
+  std::filesystem::copy(KOVA_WWW_DIR, root_.Path("/www"), std::filesystem::copy_options::recursive);
+  root_.Write("/secret.txt", "not for the web\n");
+  std::filesystem::create_symlink(root_.Path("/secret.txt"), root_.Path("/www/leak.txt"));
+  std::filesystem::create_symlink("../index.html", root_.Path("/www/js/home.html"));
+  Start({"--static", root_.Path("/www")});
+  const struct {
+    const char* path;
+    int status;
+    const char* content_type;
+  } cases[] = {
+      {"/", 200, "text/html; charset=utf-8"},
+      {"/js/app.js", 200, "text/javascript; charset=utf-8"},
+      {"/texts/enu.json", 200, "application/json; charset=utf-8"},
+      {"/favicon.svg", 200, "image/svg+xml"},
+      {"/js/home.html", 200, "text/html; charset=utf-8"},  // a link that stays inside
+      {"/leak.txt", 404, "application/json; charset=utf-8"},
+      {"/js/../leak.txt", 404, "application/json; charset=utf-8"},
+      {"/%2e%2e/secret.txt", 404, "application/json; charset=utf-8"},
+      {"/js", 404, "application/json; charset=utf-8"},  // a folder
+      {"/nothing.html", 404, "application/json; charset=utf-8"},
+  };
+  httplib::Client client("127.0.0.1", host_->port());
+  for (const auto& c : cases) {
+    const httplib::Result got = client.Get(c.path);
+    ASSERT_TRUE(got) << c.path;
+    EXPECT_EQ(got->status, c.status) << c.path;
+    EXPECT_EQ(got->get_header_value("Content-Type"), c.content_type) << c.path;
+    EXPECT_EQ(got->get_header_value("Referrer-Policy"), "no-referrer") << c.path;
+    EXPECT_THAT(got->body, Not(HasSubstr("not for the web"))) << c.path;
+    if (c.status == 404) {
+      EXPECT_EQ(got->body,
+                R"({"error":{"code":102,"errors":{"reason":"no such path"}},"success":false})")
+          << c.path;
+    }
+  }
+  const httplib::Result page = client.Get("/");
+  const httplib::Result head = client.Head("/");
+  ASSERT_TRUE(page && head);
+  EXPECT_EQ(head->status, 200);
+  EXPECT_EQ(head->get_header_value("Content-Length"), std::to_string(page->body.size()));
+  EXPECT_EQ(head->body, "");
+  EXPECT_THAT(host_->Log(), HasSubstr(" GET /%2e%2e/secret.txt 404 "));
 }
 
 }  // namespace

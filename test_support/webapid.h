@@ -55,6 +55,8 @@ class WebApid {
       : log_(root + "/host.log") {
     std::vector<std::string> argv = {program, "--port", "0"};
     argv.insert(argv.end(), args.begin(), args.end());
+    // Emptied first, so that an earlier host's port is never read from it.
+    std::ofstream(log_, std::ios::trunc).close();
     pid_ = fork();
     if (pid_ == 0) {
       freopen(log_.c_str(), "w", stderr);

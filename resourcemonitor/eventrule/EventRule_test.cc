@@ -155,8 +155,8 @@ TEST_F(EventRuleTest, HandlersChangeTheStoreOrAnswerTheirCode) {
   ASSERT_EQ(CallHandler(set_v1, R"({"enable_history": true})").GetErrorCode(), 6104);
   const Json::Value earlier = ParseJson(R"({"err_line": 143, "err_msg": "PGSQL Disable",
       "err_session": "error", "err_key": "db_connect_fail"})");
-  const std::string r1 = "1:0:x:1:2:80:1:2:0", r2 = "2:0:x:1:2:80:1:2:1", s200(200, 's');
-  const std::string switched_1 = "1:0:x:1:2:80:1:2:1", switched_2 = "2:0:x:1:2:80:1:2:0";
+  const std::string r1 = "1:0:x:1:2:80:1:2:0", r2 = "2:0:y:1:2:80:1:2:1", s200(200, 's');
+  const std::string switched_1 = "1:0:x:1:2:80:1:2:1", switched_2 = "2:0:y:1:2:80:1:2:0";
   const std::string id1 = R"({"id": "1"})";
   const Strings seeded = {r1, r2}, reload_failed = {kReloadFailed};
   const std::string full = R"({"service": ")" + s200 + R"(", "type": 1, "severity": 2,
@@ -196,6 +196,14 @@ TEST_F(EventRuleTest, HandlersChangeTheStoreOrAnswerTheirCode) {
       {rule_get_v1, id1, kEmptyList, 6102, {kGet1, kFree}, seeded, {}},
       {rule_set_v1, R"({"id": "9", "service": "x"})", kAsIs, 6107, {}, seeded, {}},
       {rule_set_v1, R"({"service": "x"})", kDuplicate, 6106, {kAdd}, seeded, {}},
+      // The store refuses a rule that repeats another's object, resource and severity.
+      {rule_set_v1,
+       R"({"service": "x", "resource": 1, "severity": 2})",
+       kAsIs,
+       6106,
+       {kAdd},
+       seeded,
+       {}},
       {rule_set_v1, id1, kStoreFails, 6102, {kGet1, kSet1, kFree}, seeded, {}},
       {rule_set_v1, id1, kNoList, 6102, {kGet1}, seeded, {}},
       {rule_set_v1, id1, kEmptyList, 6102, {kGet1, kFree}, seeded, {}},
@@ -213,7 +221,7 @@ TEST_F(EventRuleTest, HandlersChangeTheStoreOrAnswerTheirCode) {
   for (const auto& [handler, params, arrange, code, calls, stored, log] : cases) {
     kova_fake::Reset();
     Seed(0, "x", 0);
-    Seed(0, "x", 1);
+    Seed(0, "y", 1);
     kova_fake::FailService("kovaperfeventd", "reload", -1);
     arrange();
     KOVA::APIResponse response = CallHandler(handler, params);

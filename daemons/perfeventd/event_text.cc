@@ -8,7 +8,8 @@
 namespace perfeventd {
 namespace {
 
-const char* ResourceName(int32_t resource) {
+// A resource no rule can watch is named by its number, as the store holds it.
+std::string ResourceName(int32_t resource) {
   switch (resource) {
     case PERFEVENT_RESOURCE_CPU:
       return "CPU use";
@@ -16,8 +17,10 @@ const char* ResourceName(int32_t resource) {
       return "Memory use";
     case PERFEVENT_RESOURCE_IO_RATE:
       return "I/O rate";
-    default:
+    case PERFEVENT_RESOURCE_IO_LATENCY:
       return "I/O latency";
+    default:
+      return "resource " + std::to_string(resource);
   }
 }
 
@@ -40,15 +43,17 @@ std::string ObjectPhrase(const Rule& rule, const std::string& name) {
       return "service \"" + name + "\"";
     case PERFEVENT_TYPE_ISCSI_LUN:
       return "LUN \"" + name + "\"";
-    default:
+    case PERFEVENT_TYPE_SYSTEM:
       return name.empty() ? "the system" : "the system \"" + name + "\"";
+    default:
+      return "object \"" + name + "\" of type " + std::to_string(rule.type);
   }
 }
 
 }  // namespace
 
 std::string RuleSubject(const Rule& rule, const std::string& object_name) {
-  return std::string(ResourceName(rule.resource)) + " of " + ObjectPhrase(rule, object_name);
+  return ResourceName(rule.resource) + " of " + ObjectPhrase(rule, object_name);
 }
 
 Event DescribeChange(const Rule& rule, const std::string& object_name, bool raised, double average,

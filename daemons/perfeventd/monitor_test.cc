@@ -144,6 +144,29 @@ TEST_F(MonitorTest, AProblemIsSaidOnceUntilTheRuleIsMeasuredAgain) {
           "rule 2 (CPU use of service \"smb\") is skipped: the service is not running"));
 }
 
+// Rules stored with fields left out: nothing of them is sampled, and each is
+// said once, named as far as it can be.
+TEST_F(MonitorTest, RulesThatCanNeverBeMeasuredAreSkippedAndSaidOnce) {
+  const std::vector<Rule> rules = {MakeRule("1", 0, "", 0, 0, 0),
+                                   MakeRule("2", 1, "", PERFEVENT_RESOURCE_CPU, 1, 0),
+                                   MakeRule("3", 2, "", PERFEVENT_RESOURCE_IO_RATE, 1, 0),
+                                   MakeRule("4", 7, "x", PERFEVENT_RESOURCE_CPU, 1, 0)};
+  monitor_->SetRules(rules);
+  const sampling::SampleNeeds needs = monitor_->Needs();
+  EXPECT_FALSE(needs.processes || needs.disks || needs.mounts || needs.whole_disks);
+  for (int i = 0; i < 3; ++i) {
+    EXPECT_THAT(Cycle(80), ElementsAre());
+    monitor_->SetRules(rules);
+  }
+  EXPECT_THAT(
+      notices_,
+      ElementsAre("rule 1 (resource 0 of the system) is skipped: unknown resource 0",
+                  "rule 2 (CPU use of service \"\") is skipped: a service's rule needs the "
+                  "service's name",
+                  "rule 3 (I/O rate of LUN \"\") is skipped: a LUN's rule needs the LUN's uuid",
+                  "rule 4 (CPU use of object \"x\" of type 7) is skipped: unknown object type 7"));
+}
+
 TEST_F(MonitorTest, PeriodsOfSeveralCyclesAndLunDevices) {
   // A 10 s period on a 5 s cycle: each sample averages two cycles.
   monitor_->SetRules({MakeRule("1", 0, "", PERFEVENT_RESOURCE_MEMORY, 1, 50, 10, 10),

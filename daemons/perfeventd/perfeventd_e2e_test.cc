@@ -127,7 +127,11 @@ TEST_F(PerfEventE2eTest, RecordedProcRaisesReloadsRecoversAndEndsCleanly) {
   InstallDaemon("--proc " + proc + " --time-scale 0.01");
   EXPECT_TRUE(AsHost([&] {
     StartDaemon();
-    // Rules made while the daemon runs reach it by the reload signal.
+    // Rules made while the daemon runs reach it by the reload signal. The first
+    // two can never be measured: every field left out, and a service's without
+    // the service.
+    SetRule(R"({"enable": true})");
+    SetRule(R"({"type": 1, "resource": 1, "severity": 1, "enable": true})");
     SetRule(R"({"service": "", "type": 0, "resource": 2, "severity": 1, "threshold": 75,
                 "enable": true})");
     SetRule(R"({"service": "websrv", "type": 1, "resource": 2, "severity": 2, "threshold": 29,
@@ -165,7 +169,15 @@ TEST_F(PerfEventE2eTest, RecordedProcRaisesReloadsRecoversAndEndsCleanly) {
                             return line.find(") is skipped: the memory counters") !=
                                    std::string::npos;
                           }),
-            3);                        // once for each rule on the system's memory, not every cycle
+            3);  // once for each rule on the system's memory, not every cycle
+  // Said once, though the rules were read again at each change.
+  EXPECT_EQ(std::count(lines.begin(), lines.end(),
+                       "rule 1 (resource 0 of the system) is skipped: unknown resource 0"),
+            1);
+  EXPECT_EQ(std::count(lines.begin(), lines.end(),
+                       "rule 2 (CPU use of service \"\") is skipped: a service's rule needs the "
+                       "service's name"),
+            1);
   EXPECT_EQ(lines.back(), "stopped");  // SIGTERM ended it cleanly
 }
 

@@ -15,9 +15,11 @@ std::string RuleProblem(const Rule& rule) {
       break;
     case PERFEVENT_TYPE_SERVICE:
       if (!usage) return "a service's rule can watch only CPU or memory";
+      if (rule.object.empty()) return "a service's rule needs the service's name";
       break;
     case PERFEVENT_TYPE_ISCSI_LUN:
       if (!io) return "a LUN's rule can watch only I/O rate or latency";
+      if (rule.object.empty()) return "a LUN's rule needs the LUN's uuid";
       break;
     default:
       return "unknown object type " + std::to_string(rule.type);

@@ -23,8 +23,8 @@ struct Rule {
 };
 
 // Why the daemon can't evaluate `rule` whatever the system's state (an unknown
-// type, resource or severity, a resource that doesn't fit the type, a period
-// below one second); empty when it can.
+// type, resource or severity, a resource that doesn't fit the type, a service
+// or LUN rule without its object, a period below one second); empty when it can.
 std::string RuleProblem(const Rule& rule);
 
 // How many samples in a row make a window: enough to cover the duration, at

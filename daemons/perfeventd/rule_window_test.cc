@@ -74,7 +74,10 @@ TEST(RuleTest, WindowsAndProblems) {
       {{"4", 1, "smb", 3, 1, 90, 5, 30}, 6, "a service's rule can watch only CPU or memory"},
       {{"5", 7, "x", 1, 1, 90, 5, 30}, 6, "unknown object type 7"},
       {{"6", 0, "", 1, 3, 90, 5, 30}, 6, "unknown severity 3"},
+      {{"7", 1, "", 1, 1, 90, 5, 30}, 6, "a service's rule needs the service's name"},
+      {{"8", 2, "", 3, 1, 90, 5, 30}, 6, "a LUN's rule needs the LUN's uuid"},
       {{"9", 0, "", 1, 1, 90, 0, 30}, 1, "sampling period below one second"},
+      {{"10", 0, "", 0, 0, 0, 5, 30}, 6, "unknown resource 0"},  // every field left out
   };
   for (const auto& c : cases) {
     EXPECT_EQ(SamplesPerWindow(c.rule), c.samples) << c.rule.id;

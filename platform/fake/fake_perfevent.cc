@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <cstring>
 
+#include "common/rule_record.h"
 #include "fake/fake_state.h"
 #include "kova/error.h"
 #include "kova/perfevent.h"
@@ -48,6 +49,25 @@ bool WriteFails() {
   if (TheState().rule_write_error == 0) return false;
   KOVA_SET_ERROR(TheState().rule_write_error);
   return true;
+}
+
+// Refuses a record that is none, as the platform's store does.
+bool NotARecord(const KOVAPERFEVENT_CONF_SETTING* setting) {
+  if (setting != nullptr && kova::IsStorableRule(*setting)) return false;
+  KOVA_SET_ERROR(KOVA_ERR_INVALID);
+  return true;
+}
+
+// Refuses a rule that repeats the object, resource and severity of a stored
+// rule other than `own` (null for a new rule), as the platform's store does.
+bool Repeats(const KOVAPERFEVENT_CONF_SETTING& setting, const KOVAPERFEVENT_CONF_SETTING* own) {
+  for (const auto& rule : TheState().rules) {
+    if (&rule != own && kova::SameRuleKey(rule, setting)) {
+      KOVA_SET_ERROR(KOVA_ERR_PERFEVENT_DUPLICATE);
+      return true;
+    }
+  }
+  return false;
 }
 
 }  // namespace
@@ -104,19 +124,22 @@ int KOVAPerfEventIsConfExisted(const char* id) { return kova_fake::FindRule(id) 
 int KOVAPerfEventConfAdd(KOVAPERFEVENT_CONF_SETTING* setting) {
   kova_fake::RecordWrite("KOVAPerfEventConfAdd");
   if (kova_fake::WriteFails()) return -1;
+  if (kova_fake::NotARecord(setting) || kova_fake::Repeats(*setting, nullptr)) return -1;
   snprintf(setting->id, sizeof(setting->id), "%d", TheState().next_rule_id++);
   TheState().rules.push_back(*setting);
   return 0;
 }
 
 int KOVAPerfEventConfSet(const KOVAPERFEVENT_CONF_SETTING* setting) {
-  kova_fake::RecordWrite(std::string("KOVAPerfEventConfSet ") + setting->id);
-  if (kova_fake::WriteFails()) return -1;
+  kova_fake::RecordWrite(std::string("KOVAPerfEventConfSet ") +
+                         (setting != nullptr ? setting->id : "(null)"));
+  if (kova_fake::WriteFails() || kova_fake::NotARecord(setting)) return -1;
   KOVAPERFEVENT_CONF_SETTING* stored = kova_fake::FindRule(setting->id);
   if (stored == nullptr) {
     KOVA_SET_ERROR(KOVA_ERR_NOT_FOUND);
     return -1;
   }
+  if (kova_fake::Repeats(*setting, stored)) return -1;
   *stored = *setting;
   return 0;
 }

@@ -65,10 +65,14 @@ void FailLogClean(bool fail);
 // Paths handed out by QLIBCFileITmpName.
 const std::vector<std::string>& TempFiles();
 
-// The rule store. Ids are assigned "1", "2", ... on add. A failing add or set
-// returns -1 with `error` as the last platform error.
+// The rule store. Ids are assigned "1", "2", ... on add. Adds and sets refuse
+// what the platform's store refuses: a record that is none (KOVA_ERR_INVALID)
+// and a repeated object, resource and severity (KOVA_ERR_PERFEVENT_DUPLICATE).
+// A failing add or set arranged here returns -1 with `error` as the last
+// platform error.
 void FailRuleWrite(int error);
-// Stores `rule` under the next id without recording a call, and returns the id.
+// Stores `rule` under the next id without recording a call or checking it, and
+// returns the id.
 std::string AddRule(KOVAPERFEVENT_CONF_SETTING rule);
 std::vector<KOVAPERFEVENT_CONF_SETTING> Rules();
 // What KOVAPerfEventConfListGet hands out for a stored id or for all rules.

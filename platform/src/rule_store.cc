@@ -7,6 +7,7 @@
 #include <new>
 #include <string>
 
+#include "common/rule_record.h"
 #include "kova/error.h"
 #include "kova/perfevent.h"
 #include "src/privilege.h"
@@ -38,34 +39,6 @@ int64_t ParseId(const char* text) {
     if (*c < '0' || *c > '9') return 0;
   }
   return strtoll(text, nullptr, 10);
-}
-
-bool ResourceFits(int32_t type, int32_t resource) {
-  const bool usage = resource == PERFEVENT_RESOURCE_CPU || resource == PERFEVENT_RESOURCE_MEMORY;
-  const bool io =
-      resource == PERFEVENT_RESOURCE_IO_RATE || resource == PERFEVENT_RESOURCE_IO_LATENCY;
-  switch (type) {
-    case PERFEVENT_TYPE_SYSTEM:
-      return usage || io;
-    case PERFEVENT_TYPE_SERVICE:
-      return usage;
-    case PERFEVENT_TYPE_ISCSI_LUN:
-      return io;
-    default:
-      return false;
-  }
-}
-
-bool IsValid(const KOVAPERFEVENT_CONF_SETTING& rule) {
-  const size_t service = strnlen(rule.service, sizeof(rule.service));
-  const bool percent =
-      rule.resource == PERFEVENT_RESOURCE_CPU || rule.resource == PERFEVENT_RESOURCE_MEMORY;
-  return service < sizeof(rule.service) && (service > 0 || rule.type == PERFEVENT_TYPE_SYSTEM) &&
-         ResourceFits(rule.type, rule.resource) &&
-         (rule.severity == PERFEVENT_SEVERITY_WARNING ||
-          rule.severity == PERFEVENT_SEVERITY_CRITICAL) &&
-         rule.threshold >= 0 && (!percent || rule.threshold <= 100) && rule.preset_a > 0 &&
-         rule.preset_b >= 0 && (rule.enable == 0 || rule.enable == 1);
 }
 
 // Opens the store; a missing store is created only when `create` is set.
@@ -184,7 +157,7 @@ int KOVAPerfEventIsConfExisted(const char* id) {
 }
 
 int KOVAPerfEventConfAdd(KOVAPERFEVENT_CONF_SETTING* setting) {
-  if (setting == nullptr || !kova::IsValid(*setting)) {
+  if (setting == nullptr || !kova::IsStorableRule(*setting)) {
     KOVA_SET_ERROR(KOVA_ERR_INVALID);
     return -1;
   }
@@ -207,7 +180,7 @@ int KOVAPerfEventConfAdd(KOVAPERFEVENT_CONF_SETTING* setting) {
 }
 
 int KOVAPerfEventConfSet(const KOVAPERFEVENT_CONF_SETTING* setting) {
-  if (setting == nullptr || !kova::IsValid(*setting)) {
+  if (setting == nullptr || !kova::IsStorableRule(*setting)) {
     KOVA_SET_ERROR(KOVA_ERR_INVALID);
     return -1;
   }

@@ -111,27 +111,66 @@ TEST(RuleStoreTest, RefusesDuplicatesOfObjectResourceAndSeverity) {
   EXPECT_EQ(Listed(), (std::vector<std::string>{"1:smb", "2:smb"}));
 }
 
-TEST(RuleStoreTest, RefusesRulesTheDaemonCannotWatch) {
+// The store keeps whatever a rule's fields hold, also what the daemon can't
+// measure (it skips those), and refuses only what is no record.
+TEST(RuleStoreTest, KeepsRulesTheDaemonCannotMeasureAndRefusesNonRecords) {
   kova_test::TestRoot root;
-  auto with = [](auto change) {
+  const struct {
+    const char* name;
+    void (*change)(KOVAPERFEVENT_CONF_SETTING&);
+    bool kept;
+  } cases[] = {
+      {"all fields left at zero",
+       [](auto& r) {
+         r = KOVAPERFEVENT_CONF_SETTING{};
+         r.preset_a = 5;
+         r.preset_b = 30;
+       },
+       true},
+      {"a service without a name", [](auto& r) { memset(r.service, 0, sizeof(r.service)); }, true},
+      {"a service's I/O", [](auto& r) { r.resource = PERFEVENT_RESOURCE_IO_RATE; }, true},
+      {"a LUN's CPU", [](auto& r) { r.type = PERFEVENT_TYPE_ISCSI_LUN; }, true},
+      {"an unknown type", [](auto& r) { r.type = static_cast<KOVAPERFEVENT_EVENT_TYPE>(7); }, true},
+      {"an unknown severity", [](auto& r) { r.severity = 3; }, true},
+      {"a percentage above 100", [](auto& r) { r.threshold = 101; }, true},
+      {"a negative threshold", [](auto& r) { r.threshold = -1; }, true},
+      {"no terminator", [](auto& r) { memset(r.service, 'x', sizeof(r.service)); }, false},
+      {"enable 2", [](auto& r) { r.enable = 2; }, false},
+      {"no sampling period", [](auto& r) { r.preset_a = 0; }, false},
+      {"a negative duration", [](auto& r) { r.preset_b = -1; }, false},
+  };
+  // Each kept rule gets a service text of its own, so none repeats another.
+  int service = 0;
+  KOVAPERFEVENT_CONF_SETTING stored =
+      Rule(PERFEVENT_TYPE_SERVICE, "base", PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_WARNING);
+  ASSERT_EQ(KOVAPerfEventConfAdd(&stored), 0);
+  for (const auto& c : cases) {
     KOVAPERFEVENT_CONF_SETTING rule =
-        Rule(PERFEVENT_TYPE_SERVICE, "smb", PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_WARNING);
-    change(rule);
-    return rule;
-  };
-  KOVAPERFEVENT_CONF_SETTING refused[] = {
-      with([](auto& r) { r.resource = PERFEVENT_RESOURCE_IO_RATE; }),  // a service has no I/O
-      with([](auto& r) { r.type = PERFEVENT_TYPE_ISCSI_LUN; }),        // a LUN has no CPU
-      with([](auto& r) { r.severity = 3; }),
-      with([](auto& r) { r.threshold = 101; }),
-      with([](auto& r) { memset(r.service, 'x', sizeof(r.service)); }),  // no terminator
-  };
-  for (KOVAPERFEVENT_CONF_SETTING& rule : refused) {
-    EXPECT_EQ(KOVAPerfEventConfAdd(&rule), -1);
-    EXPECT_EQ(QLIBCErrGet(), KOVA_ERR_INVALID);
+        Rule(PERFEVENT_TYPE_SERVICE, "", PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_WARNING);
+    snprintf(rule.service, sizeof(rule.service), "s%d", ++service);
+    c.change(rule);
+    KOVAPERFEVENT_CONF_SETTING added = rule;
+    if (!c.kept) {
+      EXPECT_EQ(KOVAPerfEventConfAdd(&added), -1) << c.name;
+      EXPECT_EQ(QLIBCErrGet(), KOVA_ERR_INVALID) << c.name;
+    } else {
+      ASSERT_EQ(KOVAPerfEventConfAdd(&added), 0) << c.name;
+      // What is read back is what was written.
+      KovaPerfEventConfSettingNode* list = KOVAPerfEventConfListGet(added.id);
+      ASSERT_NE(list, nullptr) << c.name;
+      EXPECT_EQ(memcmp(list->setting, &added, sizeof(added)), 0) << c.name;
+      KOVAPerfEventConfListFree(list);
+      ASSERT_EQ(KOVAPerfEventConfDelete(added.id), 0) << c.name;
+    }
+    // A change of a stored rule is judged alike.
+    memcpy(rule.id, stored.id, sizeof(rule.id));
+    EXPECT_EQ(KOVAPerfEventConfSet(&rule), c.kept ? 0 : -1) << c.name;
+    if (!c.kept) {
+      EXPECT_EQ(QLIBCErrGet(), KOVA_ERR_INVALID) << c.name;
+    }
   }
   EXPECT_EQ(KOVAPerfEventConfAdd(nullptr), -1);
-  EXPECT_EQ(Listed(), std::vector<std::string>());
+  EXPECT_EQ(KOVAPerfEventConfSet(nullptr), -1);
 }
 
 }  // namespace

@@ -36,52 +36,47 @@ struct RuleListFree {
 };
 using RuleList = std::unique_ptr<KovaPerfEventConfSettingNode, RuleListFree>;
 
-// A parameter's expected JSON type; null counts as absent.
-struct ParamType {
-  const char* name;
-  bool (Json::Value::*is)() const;
-};
-
-constexpr ParamType kListParams[] = {
-    {"offset", &Json::Value::isInt64},
-    {"limit", &Json::Value::isInt64},
-    {nullptr, nullptr},
-};
-
-constexpr ParamType kSetParams[] = {
-    {"id", &Json::Value::isString},      {"enable", &Json::Value::isBool},
-    {"service", &Json::Value::isString}, {"type", &Json::Value::isInt},
-    {"severity", &Json::Value::isInt},   {"resource", &Json::Value::isInt},
-    {"threshold", &Json::Value::isInt},  {nullptr, nullptr},
-};
-
-bool WellTyped(const KOVA::APIRequest& request, const ParamType* params) {
-  for (const ParamType* param = params; param->name != nullptr; ++param) {
-    const Json::Value value = request.GetParam(param->name, Json::Value());
-    if (!value.isNull() && !(value.*param->is)()) return false;
+// Converts `value` with the JSON library's conversion `as`. False, leaving
+// `out` as it was, where the library refuses: an array or object as text, a
+// text as a boolean or integer, a number out of the integer's range.
+template <typename T>
+bool Convert(const Json::Value& value, T (Json::Value::*as)() const, T& out) {
+  try {
+    out = (value.*as)();
+    return true;
+  } catch (const Json::Exception&) {
+    return false;
   }
-  return true;
 }
 
-// Readers that give the default for an absent parameter or one of another type.
-std::string TextParam(const KOVA::APIRequest& request, const char* name) {
-  const Json::Value value = request.GetParam(name, Json::Value());
-  return value.isString() ? value.asString() : std::string();
+// The parameters of a set; absent ones convert as null: 0, empty or off.
+struct RuleParams {
+  std::string id;
+  bool enable = false;
+  std::string service;
+  int32_t type = 0;
+  int32_t severity = 0;
+  int32_t resource = 0;
+  int32_t threshold = 0;
+};
+
+template <typename T>
+bool ConvertParam(const KOVA::APIRequest& request, const char* name, T (Json::Value::*as)() const,
+                  T& out) {
+  return Convert(request.GetParam(name, Json::Value()), as, out);
 }
 
-int64_t Int64Param(const KOVA::APIRequest& request, const char* name, int64_t fallback) {
-  const Json::Value value = request.GetParam(name, Json::Value());
-  return value.isInt64() ? value.asInt64() : fallback;
-}
-
-int32_t IntParam(const KOVA::APIRequest& request, const char* name) {
-  const Json::Value value = request.GetParam(name, Json::Value());
-  return value.isInt() ? value.asInt() : 0;
-}
-
-bool BoolParam(const KOVA::APIRequest& request, const char* name) {
-  const Json::Value value = request.GetParam(name, Json::Value());
-  return value.isBool() && value.asBool();
+// Reads every parameter of a set. False when one can't be converted; it keeps
+// its default and the others are read all the same.
+bool ReadRuleParams(const KOVA::APIRequest& request, RuleParams& params) {
+  bool read = ConvertParam(request, "id", &Json::Value::asString, params.id);
+  read &= ConvertParam(request, "enable", &Json::Value::asBool, params.enable);
+  read &= ConvertParam(request, "service", &Json::Value::asString, params.service);
+  read &= ConvertParam(request, "type", &Json::Value::asInt, params.type);
+  read &= ConvertParam(request, "severity", &Json::Value::asInt, params.severity);
+  read &= ConvertParam(request, "resource", &Json::Value::asInt, params.resource);
+  read &= ConvertParam(request, "threshold", &Json::Value::asInt, params.threshold);
+  return read;
 }
 
 void AnswerBadParameter(KOVA::APIResponse* response) {
@@ -206,27 +201,30 @@ void ListEventRules(const std::string& language, std::vector<Json::Value>& rules
 }
 
 bool SetEventRules(KOVA::APIRequest* request) {
-  const std::string id = TextParam(*request, "id");
+  // The handler has refused parameters that can't be converted.
+  RuleParams params;
+  ReadRuleParams(*request, params);
   KOVAPERFEVENT_CONF_SETTING created;
   memset(&created, 0, sizeof(created));
   KOVAPERFEVENT_CONF_SETTING* record = &created;
   RuleList stored;
-  if (!id.empty()) {
-    if (KOVAPerfEventIsConfExisted(id.c_str()) == 0) return Fail(kUnknownRule);
-    stored.reset(KOVAPerfEventConfListGet(id.c_str()));
+  if (!params.id.empty()) {
+    if (KOVAPerfEventIsConfExisted(params.id.c_str()) == 0) return Fail(kUnknownRule);
+    stored.reset(KOVAPerfEventConfListGet(params.id.c_str()));
     if (stored == nullptr || stored->setting == nullptr) return Fail(kStoreFailed);
     // A change keeps only the stored id; every other field is written below.
     record = stored->setting;
   }
-  snprintf(record->service, sizeof(record->service), "%s", TextParam(*request, "service").c_str());
-  record->resource = IntParam(*request, "resource");
-  record->threshold = IntParam(*request, "threshold");
-  record->type = static_cast<KOVAPERFEVENT_EVENT_TYPE>(IntParam(*request, "type"));
-  record->severity = IntParam(*request, "severity");
-  record->enable = BoolParam(*request, "enable") ? 1 : 0;
+  snprintf(record->service, sizeof(record->service), "%s", params.service.c_str());
+  record->resource = params.resource;
+  record->threshold = params.threshold;
+  record->type = static_cast<KOVAPERFEVENT_EVENT_TYPE>(params.type);
+  record->severity = params.severity;
+  record->enable = params.enable ? 1 : 0;
   record->preset_a = kPresetA;
   record->preset_b = kPresetB;
-  const int written = id.empty() ? KOVAPerfEventConfAdd(record) : KOVAPerfEventConfSet(record);
+  const int written =
+      params.id.empty() ? KOVAPerfEventConfAdd(record) : KOVAPerfEventConfSet(record);
   if (written < 0) {
     return Fail(QLIBCErrGet() == KOVA_ERR_PERFEVENT_DUPLICATE ? kDuplicate : kStoreFailed);
   }
@@ -245,21 +243,29 @@ void DelEventRules(const Json::Value& ids) {
 
 void OnOffEventRules(const Json::Value& switches) {
   for (const Json::Value& element : switches) {
-    // Elements that are no objects, or whose members have other types, are invalid too.
-    if (!Member(element, "id").isString() || !Member(element, "enable").isBool()) {
+    // An element that is no object, or whose "id" or "enable" the JSON library
+    // can't convert, is invalid too.
+    std::string id;
+    bool enable = false;
+    if (!element.isObject() || !element.isMember("id") || !element.isMember("enable") ||
+        !Convert(element["id"], &Json::Value::asString, id) ||
+        !Convert(element["enable"], &Json::Value::asBool, enable)) {
       syslog(LOG_ERR, "%s:%d obj is not valid, it should contain 'id' & 'enable'", kSource,
              __LINE__);
       continue;
     }
-    SwitchRule(element["id"].asString(), element["enable"].asBool());
+    SwitchRule(id, enable);
   }
   ReloadDaemon();
 }
 
 void rule_list_v1(KOVA::APIRequest* request, KOVA::APIResponse* response) {
-  if (!WellTyped(*request, kListParams)) return AnswerBadParameter(response);
-  const int64_t offset = Int64Param(*request, "offset", 0);
-  const int64_t limit = Int64Param(*request, "limit", -1);
+  int64_t offset = 0;
+  int64_t limit = -1;
+  if (!Convert(request->GetParam("offset", Json::Value(0)), &Json::Value::asInt64, offset) ||
+      !Convert(request->GetParam("limit", Json::Value(-1)), &Json::Value::asInt64, limit)) {
+    return AnswerBadParameter(response);
+  }
   std::vector<Json::Value> rules;
   ListEventRules(request->GetUILanguage(), rules);
   Json::Value data;
@@ -270,8 +276,10 @@ void rule_list_v1(KOVA::APIRequest* request, KOVA::APIResponse* response) {
 }
 
 void rule_get_v1(KOVA::APIRequest* request, KOVA::APIResponse* response) {
-  const std::string id = TextParam(*request, "id");
-  if (id.empty()) return AnswerBadParameter(response);
+  std::string id;
+  if (!ConvertParam(*request, "id", &Json::Value::asString, id) || id.empty()) {
+    return AnswerBadParameter(response);
+  }
   Json::Value rule;
   if (!GetEventRules(request->GetUILanguage(), id, rule)) {
     return SetErrorFromReport(response, rule);
@@ -280,7 +288,8 @@ void rule_get_v1(KOVA::APIRequest* request, KOVA::APIResponse* response) {
 }
 
 void rule_set_v1(KOVA::APIRequest* request, KOVA::APIResponse* response) {
-  if (!WellTyped(*request, kSetParams)) return AnswerBadParameter(response);
+  RuleParams params;
+  if (!ReadRuleParams(*request, params)) return AnswerBadParameter(response);
   CriticalSection section;
   ENTERCriticalSection(section, kSource, __LINE__);
   const bool stored = SetEventRules(request);

@@ -8,6 +8,7 @@
 #include <cmath>
 #include <cstdio>
 #include <cstring>
+#include <memory>
 #include <new>
 #include <string_view>
 
@@ -172,17 +173,24 @@ class RemoveOnExit {
   const char* path_;
 };
 
+struct CloseFile {
+  void operator()(FILE* file) const { fclose(file); }
+};
+
 // Parses the log's copy at `name` and appends the entries that pass `tests`. A
-// copy that can't be opened reads as empty.
+// copy that can't be opened reads as empty. The copy is closed however the
+// read ends.
 void ReadLogCopy(const char* name, const LineTests& tests, LogRecords& records) {
-  FILE* file = fopen(name, "re");
+  const std::unique_ptr<FILE, CloseFile> file(fopen(name, "re"));
   if (file == nullptr) return;
-  setvbuf(file, nullptr, _IOFBF, 1 << 16);
+  setvbuf(file.get(), nullptr, _IOFBF, 1 << 16);
   // Room for as many records as lines of a typical length fit in the file.
   struct stat info;
-  if (fstat(fileno(file), &info) == 0) records.Reserve(static_cast<size_t>(info.st_size) / 96);
+  if (fstat(fileno(file.get()), &info) == 0) {
+    records.Reserve(static_cast<size_t>(info.st_size) / 96);
+  }
   char line[kLineBufferSize];
-  while (fgets(line, sizeof(line), file) != nullptr) {
+  while (fgets(line, sizeof(line), file.get()) != nullptr) {
     size_t length = strlen(line);
     if (length > 0 && line[length - 1] == '\n') line[--length] = '\0';
     LogLine fields;
@@ -195,7 +203,32 @@ void ReadLogCopy(const char* name, const LineTests& tests, LogRecords& records) 
       records.Add(fields.level, fields.time, std::string_view(fields.event, fields.event_length));
     }
   }
-  fclose(file);
+}
+
+// ProcessLogRecords, which may throw std::bad_alloc.
+bool ReadLog(const LogFilter& filter, LogRecords& records) {
+  const LogCompare compare(filter.sortField, filter.sortOrder == "ASC");
+  char path[kPathSize];
+  memset(path, 0, sizeof(path));
+  if (KOVALogFilePathGet(kLogTypePerfEvent, path, sizeof(path)) < 0) return false;
+  // A log that was never written has no file: it is empty.
+  struct stat info;
+  if (stat(path, &info) != 0) return true;
+
+  const LineTests tests(filter);
+  char name[kPathSize];
+  memset(name, 0, sizeof(name));
+  QLIBCFileITmpName(kTempPrefix, name, sizeof(name));
+  const RemoveOnExit remove_copy(name);
+  CriticalSection section;
+  ENTERCriticalSection(section, kSource, __LINE__);
+  if (KOVALogGet1(kLogTypePerfEvent, name, kFetchLanguage) < 0) {
+    return false;  // this early exit skips the leave on purpose: the ids stay raised
+  }
+  LEAVECriticalSection(section, kSource, __LINE__);
+  ReadLogCopy(name, tests, records);
+  records.Sort(compare);
+  return true;
 }
 
 }  // namespace
@@ -231,32 +264,13 @@ bool ContainsIgnoreCase(const std::string& haystack, const std::string& needle) 
 }
 
 bool ProcessLogRecords(const LogFilter& filter, LogRecords& records) {
-  const LogCompare compare(filter.sortField, filter.sortOrder == "ASC");
-  char path[kPathSize];
-  memset(path, 0, sizeof(path));
-  if (KOVALogFilePathGet(kLogTypePerfEvent, path, sizeof(path)) < 0) return false;
-  // A log that was never written has no file: it is empty.
-  struct stat info;
-  if (stat(path, &info) != 0) return true;
-
-  const LineTests tests(filter);
-  char name[kPathSize];
-  memset(name, 0, sizeof(name));
-  QLIBCFileITmpName(kTempPrefix, name, sizeof(name));
-  const RemoveOnExit remove_copy(name);
-  CriticalSection section;
-  ENTERCriticalSection(section, kSource, __LINE__);
-  if (KOVALogGet1(kLogTypePerfEvent, name, kFetchLanguage) < 0) {
-    return false;  // this early exit skips the leave on purpose: the ids stay raised
-  }
-  LEAVECriticalSection(section, kSource, __LINE__);
   try {
-    ReadLogCopy(name, tests, records);
-    records.Sort(compare);
+    return ReadLog(filter, records);
   } catch (const std::bad_alloc&) {
-    return false;  // a log too large for memory can't be read
+    // A log too large for memory can't be read; no part of it is answered.
+    records.Clear();
+    return false;
   }
-  return true;
 }
 
 bool ProcessLog(const LogFilter& filter, std::vector<Json::Value>& entries) {

@@ -41,9 +41,10 @@ bool ContainsIgnoreCase(const std::string& haystack, const std::string& needle);
 
 // Appends every entry of the performance-event log that passes `filter` to
 // `entries` and sorts them. Returns true on success, also when the log has never
-// been written (no entries). Returns false when the log's path can't be had or
-// its fetch fails; a failed fetch leaves the process in the privileged section.
-// The temporary copy of the log is deleted on every path that made it.
+// been written (no entries). Returns false when the log's path can't be had, its
+// fetch fails, or memory runs out while it is read (then no entry is added); a
+// failed fetch leaves the process in the privileged section. The temporary copy
+// of the log is closed and deleted on every path that made it.
 bool ProcessLog(const LogFilter& filter, std::vector<Json::Value>& entries);
 
 // ProcessLog without the JSON: reads the entries that pass `filter` into

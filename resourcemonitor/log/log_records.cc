@@ -100,6 +100,14 @@ std::string_view LogRecords::Keep(std::string_view text) {
 
 void LogRecords::Reserve(size_t count) { records_.reserve(count); }
 
+void LogRecords::Clear() {
+  std::vector<LogRecord>().swap(records_);
+  blocks_.clear();
+  blocks_.shrink_to_fit();
+  free_begin_ = nullptr;
+  free_size_ = 0;
+}
+
 void LogRecords::Sort(const LogCompare& compare) {
   const auto precedes = [&compare](const LogRecord& a, const LogRecord& b) {
     return compare.Precedes(compare.Text(a).compare(compare.Text(b)));

@@ -55,6 +55,8 @@ class LogRecords {
   void Reserve(size_t count);
   // Copies the three texts in.
   void Add(std::string_view level, std::string_view time, std::string_view event);
+  // Forgets every entry and releases their memory.
+  void Clear();
   // Puts the entries in `compare`'s order; entries that compare equal end up
   // in no defined order.
   void Sort(const LogCompare& compare);

@@ -83,17 +83,18 @@ KOVA_API void KOVAPerfEventConfListFree(KovaPerfEventConfSettingNode* head);
 KOVA_API int KOVAPerfEventIsConfExisted(const char* id);
 
 // Stores `setting` as a new rule, assigning it a new id that is written into its
-// `id`; ids are never given twice. Returns 0 on success; negative on failure, with
-// the last platform error KOVA_ERR_PERFEVENT_DUPLICATE when another rule has the
-// same object, resource and severity, and KOVA_ERR_INVALID for a rule the daemon
-// can't watch: a resource that doesn't fit the type, an unknown severity, an
-// empty object of a service or LUN, a negative threshold or a percentage above
-// 100, `preset_a` below 1, `preset_b` below 0, or `enable` other than 0 and 1.
+// `id`; ids are never given twice. Type, object, resource, severity and threshold
+// are kept as they come, also where the daemon can't measure them (it skips such
+// a rule). Returns 0 on success; negative on failure, with the last platform
+// error KOVA_ERR_PERFEVENT_DUPLICATE when another rule has the same type, object,
+// resource and severity, and KOVA_ERR_INVALID for a record that is none: an
+// object text without its terminator, `preset_a` below 1, `preset_b` below 0, or
+// `enable` other than 0 and 1.
 KOVA_API int KOVAPerfEventConfAdd(KOVAPERFEVENT_CONF_SETTING* setting);
 
 // Overwrites the stored rule whose id `setting` carries. Returns 0 on success;
-// negative on failure, with KOVA_ERR_PERFEVENT_DUPLICATE as for
-// KOVAPerfEventConfAdd and KOVA_ERR_NOT_FOUND for an unknown id.
+// negative on failure, with KOVA_ERR_PERFEVENT_DUPLICATE and KOVA_ERR_INVALID as
+// for KOVAPerfEventConfAdd and KOVA_ERR_NOT_FOUND for an unknown id.
 KOVA_API int KOVAPerfEventConfSet(const KOVAPERFEVENT_CONF_SETTING* setting);
 
 // Deletes the rule `id`. Returns 0 on success, negative when it is unknown.

@@ -157,8 +157,9 @@ TEST_F(WebApidTest, ServesEveryMethodOfTheModule) {
   const std::string id = rules.json["data"]["rules"][0]["id"].asString();
   EXPECT_EQ(rules.json["data"]["rules"][0]["name"], "Backup LUN");  // through the LUN API
   EXPECT_EQ(rules.json["data"]["support_internal"], 1);
-  // Ids are text: id=1 arrives as a number, id="1" as the text.
-  EXPECT_EQ(Code(Call(kRule, "get", {{"id", id}}, sid)), 101);
+  // Ids are text: id=1 arrives as a number, which reads as its digits, and
+  // id="1" as the text.
+  EXPECT_EQ(Call(kRule, "get", {{"id", id}}, sid).json["data"]["threshold"], 80);
   EXPECT_EQ(Call(kRule, "get", {{"id", "\"" + id + "\""}}, sid).json["data"]["threshold"], 80);
   EXPECT_EQ(Call(kRule, "onoff", {{"id_list", R"([{"id":")" + id + R"(","enable":false}])"}}, sid)
                 .json["success"],

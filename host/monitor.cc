@@ -14,6 +14,7 @@
 #include "host/json_text.h"
 #include "host/module_loader.h"
 #include "host/private_tmp.h"
+#include "host/taken_count.h"
 #include "src/accounts.h"
 
 namespace kova_host {
@@ -25,22 +26,24 @@ volatile sig_atomic_t stop_signal = 0;
 
 void OnStopSignal(int signal) { stop_signal = signal; }
 
-// Sends one message, with `fd` attached when it is not -1.
-bool Send(int socket, const Json::Value& message, int fd = -1) {
+constexpr size_t kMaxPassed = 2;  // descriptors with one message
+
+// Sends one message with the descriptors `fds` (at most kMaxPassed) attached.
+bool Send(int socket, const Json::Value& message, std::initializer_list<int> fds = {}) {
   const std::string text = ToJson(message);
   iovec data{const_cast<char*>(text.data()), text.size()};
   msghdr header{};
   header.msg_iov = &data;
   header.msg_iovlen = 1;
-  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-  if (fd >= 0) {
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * kMaxPassed)] = {};
+  if (fds.size() > 0 && fds.size() <= kMaxPassed) {
     header.msg_control = control;
-    header.msg_controllen = sizeof(control);
+    header.msg_controllen = CMSG_SPACE(sizeof(int) * fds.size());
     cmsghdr* attached = CMSG_FIRSTHDR(&header);
     attached->cmsg_level = SOL_SOCKET;
     attached->cmsg_type = SCM_RIGHTS;
-    attached->cmsg_len = CMSG_LEN(sizeof(int));
-    memcpy(CMSG_DATA(attached), &fd, sizeof(int));
+    attached->cmsg_len = CMSG_LEN(sizeof(int) * fds.size());
+    memcpy(CMSG_DATA(attached), fds.begin(), sizeof(int) * fds.size());
   }
   ssize_t sent;
   do {
@@ -49,15 +52,16 @@ bool Send(int socket, const Json::Value& message, int fd = -1) {
   return sent == static_cast<ssize_t>(text.size());
 }
 
-// Receives one message and the descriptor attached to it, if any (else -1).
-// Returns 1, 0 when the other side closed the socket, -1 on failure.
-int Receive(int socket, Json::Value& message, int* fd = nullptr) {
+// Receives one message and up to `count` descriptors attached to it into
+// `fds` (-1 where none came); others are closed. Returns 1, 0 when the other
+// side closed the socket, -1 on failure.
+int Receive(int socket, Json::Value& message, int* fds = nullptr, size_t count = 0) {
   std::string text(kMaxMessage, '\0');
   iovec data{text.data(), text.size()};
   msghdr header{};
   header.msg_iov = &data;
   header.msg_iovlen = 1;
-  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * kMaxPassed)] = {};
   header.msg_control = control;
   header.msg_controllen = sizeof(control);
   ssize_t got;
@@ -65,24 +69,30 @@ int Receive(int socket, Json::Value& message, int* fd = nullptr) {
     got = recvmsg(socket, &header, MSG_CMSG_CLOEXEC);
   } while (got < 0 && errno == EINTR);
   if (got <= 0) return got == 0 ? 0 : -1;
-  if (fd != nullptr) *fd = -1;
+  std::fill(fds, fds + count, -1);
+  size_t taken = 0;
   for (cmsghdr* attached = CMSG_FIRSTHDR(&header); attached != nullptr;
        attached = CMSG_NXTHDR(&header, attached)) {
     if (attached->cmsg_level != SOL_SOCKET || attached->cmsg_type != SCM_RIGHTS) continue;
-    int passed;
-    memcpy(&passed, CMSG_DATA(attached), sizeof(int));
-    if (fd != nullptr && *fd < 0) {
-      *fd = passed;
-    } else {
-      close(passed);
+    const size_t passed_count = (attached->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+    for (size_t i = 0; i < passed_count; ++i) {
+      int passed;
+      memcpy(&passed, CMSG_DATA(attached) + i * sizeof(int), sizeof(int));
+      if (taken < count) {
+        fds[taken++] = passed;
+      } else {
+        close(passed);
+      }
     }
   }
   text.resize(static_cast<size_t>(got));
-  const bool ok =
-      (header.msg_flags & MSG_TRUNC) == 0 && FromJson(text, message) && message.isObject();
-  if (!ok && fd != nullptr && *fd >= 0) {
-    close(*fd);
-    *fd = -1;
+  const bool ok = (header.msg_flags & (MSG_TRUNC | MSG_CTRUNC)) == 0 && FromJson(text, message) &&
+                  message.isObject();
+  if (!ok) {
+    for (size_t i = 0; i < count; ++i) {
+      if (fds[i] >= 0) close(fds[i]);
+      fds[i] = -1;
+    }
   }
   return ok ? 1 : -1;
 }
@@ -161,11 +171,16 @@ class Monitor {
       if (runner_setup.private_tmp.empty())
         HostLog("runner of %s: %s", module.c_str(), error.c_str());
     }
+    std::string error;
+    const int taken = TakenCount::Create(error);
     int pair[2];
-    if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0) {
+    if (taken < 0 || socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0) {
+      if (taken < 0) error = std::string("socketpair: ") + strerror(errno);
+      if (taken >= 0) close(taken);
       Ended(module, runner, 0);
-      return Send(control_, Failure(std::string("socketpair: ") + strerror(errno)));
+      return Send(control_, Failure(error));
     }
+    runner_setup.taken_fd = taken;
     runner.pid = fork();
     if (runner.pid == 0) {
       for (int signal : {SIGTERM, SIGHUP, SIGINT}) ::signal(signal, SIG_DFL);
@@ -176,12 +191,14 @@ class Monitor {
     close(pair[1]);
     if (runner.pid < 0) {
       close(pair[0]);
+      close(taken);
       Ended(module, runner, 0);
       return Send(control_, Failure(std::string("fork: ") + strerror(errno)));
     }
     runners_[module] = runner;
-    const bool sent = Send(control_, Json::Value(Json::objectValue), pair[0]);
+    const bool sent = Send(control_, Json::Value(Json::objectValue), {pair[0], taken});
     close(pair[0]);
+    close(taken);
     return sent;
   }
 
@@ -265,19 +282,26 @@ int RunMonitor(int control, pid_t front_end, const MonitorSetup& setup) {
   return Monitor(control, front_end, setup).Run();
 }
 
-int MonitorClient::Start(const std::string& module, std::string& error) {
+int MonitorClient::Start(const std::string& module, int& taken_fd, std::string& error) {
   std::lock_guard lock(mutex_);
   Json::Value request;
   request["op"] = "start";
   request["module"] = module;
   Json::Value answer;
-  int fd = -1;
-  if (!Send(control_, request) || Receive(control_, answer, &fd) != 1) {
+  int fds[2] = {-1, -1};
+  if (!Send(control_, request) || Receive(control_, answer, fds, 2) != 1) {
     error = "the monitor does not answer";
     return -1;
   }
-  if (fd < 0) error = answer["error"].isString() ? answer["error"].asString() : "no runner";
-  return fd;
+  if (fds[0] < 0 || fds[1] < 0) {
+    error = answer["error"].isString() ? answer["error"].asString() : "no runner";
+    for (int fd : fds) {
+      if (fd >= 0) close(fd);
+    }
+    return -1;
+  }
+  taken_fd = fds[1];
+  return fds[0];
 }
 
 void MonitorClient::Stop(const std::string& module) {

@@ -35,8 +35,9 @@ class MonitorClient {
   explicit MonitorClient(int control) : control_(control) {}
 
   // Starts a fresh runner for `module`, a file name of the modules folder
-  // (stopping its runner before), and hands over its socket; -1 with `error`.
-  int Start(const std::string& module, std::string& error);
+  // (stopping its runner before), and hands over its socket and the memory
+  // file of its TakenCount (`taken_fd`); -1 with `error`.
+  int Start(const std::string& module, int& taken_fd, std::string& error);
   // Stops the runner of `module` at once.
   void Stop(const std::string& module);
   // 1 when `password` is the account's (`admin` then set), 0 when not, -1 on failure.

@@ -17,7 +17,7 @@ struct Options {
   std::string static_dir;       // default: /usr/share/kova/www under the system root
   std::chrono::seconds idle_timeout{900};
   std::chrono::seconds call_timeout{120};
-  size_t max_waiting_calls = 256;  // per module, besides the running call
+  size_t max_waiting_calls = 4096;  // per module, besides those sent to its runner
   // Limits of the HTTP front-end.
   size_t max_connections = 10000;
   size_t max_per_address = 256;                // connections from one client address

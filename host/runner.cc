@@ -16,6 +16,7 @@
 #include "host/host_log.h"
 #include "host/json_text.h"
 #include "host/module_loader.h"
+#include "host/taken_count.h"
 #include "kova/webapi.h"
 
 namespace kova_host {
@@ -153,13 +154,12 @@ int RunRunner(int fd, const RunnerSetup& setup) {
   }
   if (SendReady(fd, KOVA::APIRunner::List()) != IoResult::kOk) return 1;
   FrameReader reader(fd);
+  TakenCount taken(setup.taken_fd);
   for (;;) {
     RunnerCall call;
     const IoResult got = ReceiveCall(reader, call);
     if (got == IoResult::kClosed) return 0;
-    if ((got == IoResult::kOk || got == IoResult::kMalformed) && SendTaken(fd) != IoResult::kOk) {
-      return 1;
-    }
+    if (got == IoResult::kOk || got == IoResult::kMalformed) taken.Add();
     if (got == IoResult::kMalformed) {
       // The frame was read whole, so the runner answers it and takes the next.
       HostLog("runner: refused a malformed call from the front-end");

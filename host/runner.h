@@ -21,6 +21,7 @@ struct RunnerSetup {
   // empty to share it.
   std::string private_tmp;
   std::string tmp_dir;
+  int taken_fd = -1;  // the memory file of its TakenCount
 };
 
 // Serves calls on `fd` until the front-end closes it. Returns the exit status.

@@ -16,6 +16,9 @@ constexpr std::chrono::seconds kStartTimeout{60};
 // A call larger than this is sent only to an idle runner, so that writing it
 // can't wait on a runner that is itself waiting to write a large answer.
 constexpr size_t kMaxQueuedCall = 64 * 1024;
+// The calls waiting for one runner hold at most this much, however many they
+// are: a few large bodies fill the queue as many small calls do.
+constexpr size_t kMaxWaitingBytes = size_t{64} << 20;
 
 const char* Why(IoResult result) {
   switch (result) {
@@ -71,8 +74,11 @@ bool RunnerClient::Start(std::string& error) {
 }
 
 bool RunnerClient::StartRunner(std::string& error) {
-  const int fd = launcher_.Start(error);
+  int taken_fd = -1;
+  const int fd = launcher_.Start(taken_fd, error);
   if (fd < 0) return false;
+  auto taken = std::make_unique<TakenCount>(taken_fd);
+  close(taken_fd);
   Json::Value methods;
   auto reader = std::make_unique<FrameReader>(fd);
   const IoResult ready = ReceiveReady(*reader, methods, Clock::now() + kStartTimeout);
@@ -85,6 +91,8 @@ bool RunnerClient::StartRunner(std::string& error) {
   }
   fd_ = fd;
   reader_ = std::move(reader);
+  taken_ = std::move(taken);
+  answered_ = 0;
   std::lock_guard lock(methods_mutex_);
   methods_ = std::make_shared<const Json::Value>(std::move(methods));
   return true;
@@ -108,9 +116,11 @@ void RunnerClient::Submit(const RunnerCall& call, CallDone done) {
     std::lock_guard lock(mutex_);
     if (stopping_) {
       refused = CallResult::kFailed;
-    } else if (queue_.size() >= max_waiting_) {
+    } else if (queue_.size() >= max_waiting_ ||
+               waiting_bytes_ + pending->message.size() > kMaxWaitingBytes) {
       refused = CallResult::kBusy;
     } else {
+      waiting_bytes_ += pending->message.size();
       queue_.push_back(pending.release());
     }
   }
@@ -133,7 +143,8 @@ void RunnerClient::Abandon(IoResult why) {
   Pending* running = sent_.front();
   // A runner that ended before taking the call never ran it: the call goes to
   // a fresh runner, once, with those behind it.
-  const bool retry = !taken_ && why != IoResult::kTimeout && running->retried++ == 0;
+  const bool taken = !taken_->mapped() || taken_->Read() > answered_;
+  const bool retry = !taken && why != IoResult::kTimeout && running->retried++ == 0;
   if (retry) {
     HostLog("%s: the runner ended before taking the call; a fresh runner takes it",
             running->name.c_str());
@@ -144,6 +155,7 @@ void RunnerClient::Abandon(IoResult why) {
   StopRunner();
   {
     std::lock_guard lock(mutex_);
+    for (const Pending* again : sent_) waiting_bytes_ += again->message.size();
     queue_.insert(queue_.begin(), sent_.begin(), sent_.end());
   }
   sent_.clear();
@@ -159,11 +171,9 @@ bool RunnerClient::SendWaiting() {
       if (!sent_.empty() && queue_.front()->message.size() > kMaxQueuedCall) return true;
       next = queue_.front();
       queue_.pop_front();
+      waiting_bytes_ -= next->message.size();
     }
-    if (sent_.empty()) {
-      running_since_ = Clock::now();
-      taken_ = false;
-    }
+    if (sent_.empty()) running_since_ = Clock::now();
     sent_.push_back(next);
     const IoResult sent = WriteFrame(fd_, next->message, running_since_ + call_timeout_);
     if (sent == IoResult::kClosed || sent == IoResult::kError) {
@@ -198,6 +208,7 @@ void RunnerClient::Dispatch() {
         {
           std::lock_guard lock(mutex_);
           failed.swap(queue_);
+          waiting_bytes_ = 0;
         }
         for (Pending* pending : failed) Finish(pending, CallResult::kFailed, "no runner: " + error);
         continue;
@@ -234,20 +245,14 @@ void RunnerClient::Dispatch() {
     }
     if (fd_ >= 0 && (buffered || fds[1].revents != 0)) {
       Pending* running = sent_.front();
-      bool taken = false;
-      const IoResult got =
-          ReceiveAnswer(*reader_, taken, running->answer, running_since_ + call_timeout_);
+      const IoResult got = ReceiveAnswer(*reader_, running->answer, running_since_ + call_timeout_);
       if (got != IoResult::kOk) {
         Abandon(got);
         continue;
       }
-      running_since_ = Clock::now();  // a call's time runs from when the runner takes it
-      if (taken) {
-        taken_ = true;
-        continue;
-      }
       sent_.pop_front();
-      taken_ = false;
+      ++answered_;
+      running_since_ = Clock::now();  // the runner goes on to the next call at once
       Finish(running, CallResult::kAnswered, "");
     } else if (Clock::now() >= running_since_ + call_timeout_) {
       Abandon(IoResult::kTimeout);

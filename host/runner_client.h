@@ -21,6 +21,7 @@
 #include <thread>
 
 #include "host/runner_protocol.h"
+#include "host/taken_count.h"
 
 namespace kova_host {
 
@@ -28,8 +29,9 @@ namespace kova_host {
 class RunnerLauncher {
  public:
   virtual ~RunnerLauncher() = default;
-  // A fresh runner's socket, or -1 with `error`.
-  virtual int Start(std::string& error) = 0;
+  // A fresh runner's socket, with the memory file of its TakenCount in
+  // `taken_fd` (both the caller's to close), or -1 with `error`.
+  virtual int Start(int& taken_fd, std::string& error) = 0;
   // Stops the runner at once.
   virtual void Stop() = 0;
 };
@@ -44,7 +46,8 @@ using CallDone = std::function<void(CallResult result, RunnerAnswer answer, std:
 
 class RunnerClient {
  public:
-  // At most `max_waiting` calls wait for the runner besides the running one.
+  // At most `max_waiting` calls, and 64 MiB of them, wait for the runner
+  // besides those it was sent.
   RunnerClient(RunnerLauncher& launcher, std::chrono::milliseconds call_timeout,
                size_t max_waiting);
   ~RunnerClient();
@@ -87,14 +90,16 @@ class RunnerClient {
 
   std::mutex mutex_;
   std::deque<Pending*> queue_;  // calls not yet sent, in order
+  size_t waiting_bytes_ = 0;    // their encoded size
   bool stopping_ = false;
 
   // Used by the dispatcher only (and by Start before it runs).
   int fd_ = -1;
   std::unique_ptr<FrameReader> reader_;
-  std::deque<Pending*> sent_;  // sent calls, the first one running
-  bool taken_ = false;         // the runner has taken the first sent call
-  bool write_failed_ = false;  // the runner's socket takes no more calls
+  std::deque<Pending*> sent_;          // sent calls, the first one running
+  std::unique_ptr<TakenCount> taken_;  // calls the runner has taken
+  uint64_t answered_ = 0;              // calls the runner has answered
+  bool write_failed_ = false;          // the runner's socket takes no more calls
   Clock::time_point running_since_;
 
   mutable std::mutex methods_mutex_;

@@ -17,11 +17,13 @@
 namespace kova_host {
 namespace {
 
-// A runner answers "echo" with its number; "vanish" closes its socket unread
-// the first time; "crash" closes after taking the call; "hang" takes it and
-// waits; "pair" holds its answer until the next call came, then writes both
-// answers, with their notices, in one write.
-void PlayRunner(int fd, int number, bool first) {
+// A runner counts each call it takes, and answers "echo" with its number;
+// "vanish" closes its socket before taking it, the first time; "crash" closes
+// after taking it; "hang" takes it and waits; "pair" holds its answer until the
+// next call came, then writes both answers in one write.
+void PlayRunner(int fd, int taken_fd, int number, bool first) {
+  TakenCount taken(taken_fd);
+  close(taken_fd);
   Json::Value methods(Json::arrayValue);
   if (SendReady(fd, methods) != IoResult::kOk) return;
   FrameReader reader(fd);
@@ -34,15 +36,15 @@ void PlayRunner(int fd, int number, bool first) {
   RunnerCall call;
   while (ReceiveCall(reader, call) == IoResult::kOk) {
     if (call.method == "vanish" && first) break;
+    taken.Add();
     if (call.method == "pair") {
       RunnerCall next;
       if (ReceiveCall(reader, next) != IoResult::kOk) break;
+      taken.Add();
       // Both answers as the runner's socket would hold them: one read takes all.
       int pipe[2];
       if (socketpair(AF_UNIX, SOCK_STREAM, 0, pipe) != 0) break;
-      SendTaken(pipe[0]);
       SendAnswer(pipe[0], answer(call));
-      SendTaken(pipe[0]);
       SendAnswer(pipe[0], answer(next));
       shutdown(pipe[0], SHUT_WR);
       std::string bytes(1 << 16, '\0');
@@ -52,7 +54,7 @@ void PlayRunner(int fd, int number, bool first) {
       if (got <= 0 || write(fd, bytes.data(), static_cast<size_t>(got)) != got) break;
       continue;
     }
-    if (SendTaken(fd) != IoResult::kOk || call.method == "crash") break;
+    if (call.method == "crash") break;
     if (call.method == "hang") {
       char byte;
       while (read(fd, &byte, 1) > 0) {
@@ -70,13 +72,14 @@ class FakeLauncher : public RunnerLauncher {
     Stop();
     for (std::thread& runner : runners_) runner.join();
   }
-  int Start(std::string&) override {
+  int Start(int& taken_fd, std::string& error) override {
+    taken_fd = TakenCount::Create(error);
     int pair[2];
-    if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0) return -1;
+    if (taken_fd < 0 || socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0) return -1;
     std::lock_guard lock(mutex_);
     const int number = static_cast<int>(runners_.size()) + 1;
     current_ = pair[1];
-    runners_.emplace_back(PlayRunner, pair[1], number, number == 1);
+    runners_.emplace_back(PlayRunner, pair[1], dup(taken_fd), number, number == 1);
     return pair[0];
   }
   // Ends the runner's side the way a killed runner's ends.

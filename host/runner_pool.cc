@@ -14,7 +14,9 @@ struct RunnerPool::Module : RunnerLauncher {
          size_t max_waiting)
       : monitor(monitor), file(std::move(file)), client(*this, call_timeout, max_waiting) {}
 
-  int Start(std::string& error) override { return monitor.Start(file, error); }
+  int Start(int& taken_fd, std::string& error) override {
+    return monitor.Start(file, taken_fd, error);
+  }
   void Stop() override { monitor.Stop(file); }
 
   MonitorClient& monitor;

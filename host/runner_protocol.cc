@@ -64,8 +64,6 @@ IoResult ReceiveCall(FrameReader& reader, RunnerCall& call) {
   return IoResult::kOk;
 }
 
-IoResult SendTaken(int fd) { return WriteFrame(fd, R"({"kind":"taken"})", kNoDeadline); }
-
 IoResult SendAnswer(int fd, const RunnerAnswer& answer) {
   Json::Value header;
   header["kind"] = answer.raw ? "raw" : "json";
@@ -73,14 +71,11 @@ IoResult SendAnswer(int fd, const RunnerAnswer& answer) {
   return WriteFrames(fd, ToJson(header), answer.body, kNoDeadline);
 }
 
-IoResult ReceiveAnswer(FrameReader& reader, bool& taken, RunnerAnswer& answer,
-                       Clock::time_point deadline) {
+IoResult ReceiveAnswer(FrameReader& reader, RunnerAnswer& answer, Clock::time_point deadline) {
   Json::Value header;
   const IoResult got = ReadJson(reader, header, deadline);
   if (got != IoResult::kOk) return got;
   const Json::Value& kind = header["kind"];
-  taken = kind == "taken";
-  if (taken) return IoResult::kOk;
   if ((kind != "raw" && kind != "json") || !header["code"].isInt()) return IoResult::kError;
   answer.raw = kind == "raw";
   answer.code = header["code"].asInt();

@@ -2,8 +2,6 @@
 // each message a frame of JSON:
 //   runner, once started:  {"kind": "ready", "methods": [{"api", "version", "method"}...]}
 //   front-end, a call:     {"api", "version", "method", "params", "user", "language"}
-//   runner, on reading it: {"kind": "taken"}, so that a call is known to have
-//                          reached the runner before it ran
 //   runner, the answer:    {"kind": "json" | "raw", "code": CODE}, then one more frame:
 //                          the answer's envelope as JSON text ("json"), or everything
 //                          the handler wrote to standard output ("raw").
@@ -44,12 +42,8 @@ IoResult SendCall(int fd, const RunnerCall& call, Clock::time_point deadline);
 // can still be read.
 IoResult ReceiveCall(FrameReader& reader, RunnerCall& call);
 
-IoResult SendTaken(int fd);
 IoResult SendAnswer(int fd, const RunnerAnswer& answer);
-// The runner's next message: `taken` is set for the notice that it took the
-// next call, else `answer` holds the answer.
-IoResult ReceiveAnswer(FrameReader& reader, bool& taken, RunnerAnswer& answer,
-                       Clock::time_point deadline);
+IoResult ReceiveAnswer(FrameReader& reader, RunnerAnswer& answer, Clock::time_point deadline);
 
 }  // namespace kova_host
 

@@ -41,27 +41,18 @@ TEST_F(RunnerProtocolTest, CallsAndAnswersCrossWhole) {
 
   // A raw answer larger than a socket buffer, with bytes that are no UTF-8.
   std::string output = "Content-Type: text/csv\r\n\r\n" + std::string(3 << 20, '\xff');
-  // The notice that the call was taken comes first.
-  std::thread writer([&] {
-    EXPECT_EQ(SendTaken(fds_[1]), IoResult::kOk);
-    EXPECT_EQ(SendAnswer(fds_[1], {true, 0, output}), IoResult::kOk);
-  });
+  std::thread writer([&] { EXPECT_EQ(SendAnswer(fds_[1], {true, 0, output}), IoResult::kOk); });
   RunnerAnswer answer;
-  bool taken = false;
-  const auto deadline = Clock::now() + std::chrono::seconds(10);
-  EXPECT_EQ(ReceiveAnswer(reader_[0], taken, answer, deadline), IoResult::kOk);
-  EXPECT_TRUE(taken);
-  EXPECT_EQ(ReceiveAnswer(reader_[0], taken, answer, deadline), IoResult::kOk);
+  EXPECT_EQ(ReceiveAnswer(reader_[0], answer, Clock::now() + std::chrono::seconds(10)),
+            IoResult::kOk);
   writer.join();
-  EXPECT_FALSE(taken);
   EXPECT_TRUE(answer.raw);
   EXPECT_EQ(answer.body, output);
 }
 
 TEST_F(RunnerProtocolTest, ReportsTimeoutsClosedPeersAndMalformedFrames) {
   RunnerAnswer answer;
-  bool taken = false;
-  EXPECT_EQ(ReceiveAnswer(reader_[0], taken, answer, Clock::now() + std::chrono::milliseconds(50)),
+  EXPECT_EQ(ReceiveAnswer(reader_[0], answer, Clock::now() + std::chrono::milliseconds(50)),
             IoResult::kTimeout);
 
   ASSERT_EQ(WriteFrame(fds_[1], R"({"api": "x"})", kNoDeadline), IoResult::kOk);
@@ -90,7 +81,7 @@ TEST_F(RunnerProtocolTest, ReportsTimeoutsClosedPeersAndMalformedFrames) {
   reader_[0] = FrameReader(fds_[0]);  // a reader past a frame too large is done with
   close(fds_[1]);
   fds_[1] = -1;
-  EXPECT_EQ(ReceiveAnswer(reader_[0], taken, answer, kNoDeadline), IoResult::kClosed);
+  EXPECT_EQ(ReceiveAnswer(reader_[0], answer, kNoDeadline), IoResult::kClosed);
   EXPECT_EQ(SendCall(fds_[0], call, kNoDeadline), IoResult::kClosed);
 }
 

@@ -8,6 +8,7 @@
 #include <cstdio>
 #include <functional>
 #include <map>
+#include <ostream>
 #include <regex>
 #include <tuple>
 
@@ -25,11 +26,6 @@ using kova_test::CallHandler;
 using kova_test::ParseJson;
 using Strings = std::vector<std::string>;
 
-constexpr char kGet1[] = "KOVAPerfEventConfListGet 1";
-constexpr char kSet1[] = "KOVAPerfEventConfSet 1";
-constexpr char kAdd[] = "KOVAPerfEventConfAdd";
-constexpr char kFree[] = "KOVAPerfEventConfListFree";
-constexpr char kReload[] = "QLIBServiceReload kovaperfeventd";
 constexpr char kReloadFailed[] =
     "EventRule:N Failed to reload kovaperfeventd [0x1001 fake_system.cc:N]";
 constexpr char kInfo[] = "/var/packages/Foo/INFO";
@@ -67,16 +63,41 @@ void Seed(int type, const char* service, int enable = 1) {
   kova_fake::AddRule(rule);
 }
 
-// The store as "id:type:service:resource:severity:threshold:preset_a:preset_b:enable".
-Strings StoredRules() {
-  Strings rules;
+// A stored rule, field by field.
+struct Rule {
+  std::string id;
+  int type;
+  std::string service;
+  int resource, severity, threshold, preset_a, preset_b, enable;
+  bool operator==(const Rule&) const = default;
+};
+using Rules = std::vector<Rule>;
+
+std::ostream& operator<<(std::ostream& out, const Rule& r) {
+  return out << "{" << r.id << " type " << r.type << " " << r.service << " resource " << r.resource
+             << " severity " << r.severity << " threshold " << r.threshold << " presets "
+             << r.preset_a << "/" << r.preset_b << " enable " << r.enable << "}";
+}
+
+Rules StoredRules() {
+  Rules rules;
   for (const KOVAPERFEVENT_CONF_SETTING& r : kova_fake::Rules()) {
-    char text[1300];
-    snprintf(text, sizeof(text), "%s:%d:%s:%d:%d:%d:%d:%d:%d", r.id, r.type, r.service, r.resource,
-             r.severity, r.threshold, r.preset_a, r.preset_b, r.enable);
-    rules.push_back(text);
+    rules.push_back({r.id, r.type, r.service, r.resource, r.severity, r.threshold, r.preset_a,
+                     r.preset_b, r.enable});
   }
   return rules;
+}
+
+// The two rules each table starts from: 1 off, 2 on.
+const Rule kOff1{"1", 0, "x", 1, 2, 80, 1, 2, 0};
+const Rule kOn2{"2", 0, "y", 1, 2, 80, 1, 2, 1};
+const Rule kOn1{"1", 0, "x", 1, 2, 80, 1, 2, 1};
+const Rule kOff2{"2", 0, "y", 1, 2, 80, 1, 2, 0};
+const Rules kSeeded = {kOff1, kOn2};
+
+void SeedTwo() {
+  Seed(0, "x", 0);
+  Seed(0, "y", 1);
 }
 
 // Lines logged at error priority, with source lines written as "N".
@@ -148,21 +169,90 @@ TEST_F(EventRuleTest, GetAnswersTheRuleObjectOnForExactlyOne) {
   }
 }
 
-// Rules 1 (off) and 2 (on) are stored first and the daemon's reload fails. The
-// rule paths set only the record's code: the rest is what a Setting failure left.
-TEST_F(EventRuleTest, HandlersChangeTheStoreOrAnswerTheirCode) {
+// One call of a handler on rules 1 and 2 while the daemon's reload fails.
+struct HandlerRow {
+  std::string params;
+  std::function<void()> arrange;
+  int code;  // 0: success
+  Rules stored;
+  Strings error_log;
+};
+
+// A Setting failure fills the record first: the rule paths set only its code,
+// so a rule error answers the rest of what that failure left.
+void RunHandlerRows(APIHandler handler, const std::vector<HandlerRow>& rows) {
   kova_fake::SetVolumeLookup("pgsql", 1, "/volume1");
   ASSERT_EQ(CallHandler(set_v1, R"({"enable_history": true})").GetErrorCode(), 6104);
   const Json::Value earlier = ParseJson(R"({"err_line": 143, "err_msg": "PGSQL Disable",
       "err_session": "error", "err_key": "db_connect_fail"})");
-  const std::string r1 = "1:0:x:1:2:80:1:2:0", r2 = "2:0:y:1:2:80:1:2:1", s200(200, 's');
-  const std::string switched_1 = "1:0:x:1:2:80:1:2:1", switched_2 = "2:0:y:1:2:80:1:2:0";
-  const std::string id1 = R"({"id": "1"})";
-  const Strings seeded = {r1, r2}, reload_failed = {kReloadFailed};
+  for (const HandlerRow& row : rows) {
+    kova_fake::Reset();
+    SeedTwo();
+    kova_fake::FailService("kovaperfeventd", "reload", -1);
+    row.arrange();
+    KOVA::APIResponse response = CallHandler(handler, row.params);
+    EXPECT_EQ(response.GetSettleCount(), 1) << row.params;
+    EXPECT_EQ(response.GetErrorCode(), row.code) << row.params;
+    const bool plain = row.code == 0 || row.code == 101;
+    EXPECT_EQ(response.GetData(), plain ? Json::Value() : earlier) << row.params;
+    EXPECT_EQ(StoredRules(), row.stored) << row.params;
+    EXPECT_EQ(ErrorLog(), row.error_log) << row.params;
+    ExpectListsFreed(row.params);
+  }
+}
+
+const Strings kReloadFailedLog = {kReloadFailed};
+
+TEST_F(EventRuleTest, GetAnswers101Or6102ForARuleItCannotName) {
+  RunHandlerRows(rule_get_v1, {
+                                  {"{}", kAsIs, 101, kSeeded, {}},
+                                  {R"({"id": ""})", kAsIs, 101, kSeeded, {}},
+                                  {R"({"id": "9"})", kAsIs, 6102, kSeeded, {}},
+                                  {R"({"id": "1"})", kEmptyList, 6102, kSeeded, {}},
+                              });
+}
+
+TEST_F(EventRuleTest, SetAddsOrChangesARuleAndReloadsTheDaemon) {
+  const std::string s200(200, 's');
   const std::string full = R"({"service": ")" + s200 + R"(", "type": 1, "severity": 2,
       "resource": 3, "threshold": 90, "enable": true})";
-  const std::string created = "3:1:" + s200.substr(0, 127) + ":3:2:90:5:30:1";
-  const char* ids = R"({"id_list": [12, "1", null, "9", {"id": "2"}, ["2"], "1"]})";
+  const Rule created{"3", 1, s200.substr(0, 127), 3, 2, 90, 5, 30, 1};
+  const Rule blank3{"3", 0, "", 0, 0, 0, 5, 30, 0};
+  const Rule blank2{"2", 0, "", 0, 0, 0, 5, 30, 0};
+  RunHandlerRows(
+      rule_set_v1,
+      {
+          {R"({"enable": "true"})", kAsIs, 101, kSeeded, {}},
+          {R"({"threshold": 2147483648})", kAsIs, 101, kSeeded, {}},
+          {R"({"id": "9", "service": "x"})", kAsIs, 6107, kSeeded, {}},
+          {R"({"service": "x"})", kDuplicate, 6106, kSeeded, {}},
+          // The store refuses a rule that repeats another's object, resource and severity.
+          {R"({"service": "x", "resource": 1, "severity": 2})", kAsIs, 6106, kSeeded, {}},
+          {R"({"id": "1"})", kStoreFails, 6102, kSeeded, {}},
+          {R"({"id": "1"})", kNoList, 6102, kSeeded, {}},
+          {R"({"id": "1"})", kEmptyList, 6102, kSeeded, {}},
+          {"{}", kAsIs, 0, {kOff1, kOn2, blank3}, kReloadFailedLog},
+          {full, kAsIs, 0, {kOff1, kOn2, created}, kReloadFailedLog},
+          // A change writes absent parameters as 0, empty or off.
+          {R"({"id": "2"})", kAsIs, 0, {kOff1, blank2}, kReloadFailedLog},
+      });
+}
+
+TEST_F(EventRuleTest, DeleteRemovesTheIdsItCanReadAndReloads) {
+  RunHandlerRows(rule_delete_v1,
+                 {
+                     {"{}", kAsIs, 101, kSeeded, {}},
+                     {R"({"id_list": "1"})", kAsIs, 101, kSeeded, {}},
+                     {R"({"id_list": [12, "1", null, "9", {"id": "2"}, ["2"], "1"]})",
+                      kAsIs,
+                      0,
+                      {kOn2},
+                      kReloadFailedLog},
+                     {R"({"id_list": []})", kAsIs, 0, kSeeded, kReloadFailedLog},
+                 });
+}
+
+TEST_F(EventRuleTest, OnOffSwitchesEachValidPairAndLogsTheRest) {
   const char* both = R"({"id_list": [{"id": "1", "enable": true}, {"id": "2", "enable": false}]})";
   const char* mixed = R"({"id_list": [{"id": "1", "enable": true}, {"id": "2"}, {"enable": false},
       "2", {"id": ["1"], "enable": false}, {"id": "1", "enable": "false"},
@@ -172,64 +262,14 @@ TEST_F(EventRuleTest, HandlersChangeTheStoreOrAnswerTheirCode) {
   invalid.push_back(kReloadFailed);
   const Strings failed = {"EventRule:N Failed to enable [1]'s enable (true)",
                           "EventRule:N Failed to enable [2]'s enable (false)", kReloadFailed};
-  const std::string get2 = "KOVAPerfEventConfListGet 2";
-  const Strings change = {get2, "KOVAPerfEventConfSet 2", kReload, kFree};
-  const Strings walk = {kGet1, kSet1, kFree, get2, "KOVAPerfEventConfSet 2", kFree, kReload};
-  const Strings empty_walk = {kGet1, kFree, get2, kFree, kReload};
-  // handler, params, arrangement, code (0: success), calls, store, error log
-  using Case =
-      std::tuple<APIHandler, std::string, std::function<void()>, int, Strings, Strings, Strings>;
-  const Case cases[] = {
-      // Parameters the handler can't convert: 101 with null data, nothing called.
-      {rule_get_v1, "{}", kAsIs, 101, {}, seeded, {}},
-      {rule_get_v1, R"({"id": ""})", kAsIs, 101, {}, seeded, {}},
-      {rule_delete_v1, "{}", kAsIs, 101, {}, seeded, {}},
-      {rule_delete_v1, R"({"id_list": "1"})", kAsIs, 101, {}, seeded, {}},
-      {rule_onoff_v1, R"({"id_list": {"id": "1", "enable": true}})", kAsIs, 101, {}, seeded, {}},
-      {rule_set_v1, R"({"enable": "true"})", kAsIs, 101, {}, seeded, {}},
-      {rule_set_v1, R"({"threshold": 2147483648})", kAsIs, 101, {}, seeded, {}},
-      {rule_list_v1, R"({"offset": "2"})", kAsIs, 101, {}, seeded, {}},
-      {rule_get_v1, R"({"id": "9"})", kAsIs, 6102, {"KOVAPerfEventConfListGet 9"}, seeded, {}},
-      {rule_get_v1, id1, kEmptyList, 6102, {kGet1, kFree}, seeded, {}},
-      {rule_set_v1, R"({"id": "9", "service": "x"})", kAsIs, 6107, {}, seeded, {}},
-      {rule_set_v1, R"({"service": "x"})", kDuplicate, 6106, {kAdd}, seeded, {}},
-      // The store refuses a rule that repeats another's object, resource and severity.
-      {rule_set_v1,
-       R"({"service": "x", "resource": 1, "severity": 2})",
-       kAsIs,
-       6106,
-       {kAdd},
-       seeded,
-       {}},
-      {rule_set_v1, id1, kStoreFails, 6102, {kGet1, kSet1, kFree}, seeded, {}},
-      {rule_set_v1, id1, kNoList, 6102, {kGet1}, seeded, {}},
-      {rule_set_v1, id1, kEmptyList, 6102, {kGet1, kFree}, seeded, {}},
-      {rule_set_v1, "{}", kAsIs, 0, {kAdd, kReload}, {r1, r2, "3:0::0:0:0:5:30:0"}, reload_failed},
-      {rule_set_v1, full, kAsIs, 0, {kAdd, kReload}, {r1, r2, created}, reload_failed},
-      // A change writes absent parameters as 0, empty or off.
-      {rule_set_v1, R"({"id": "2"})", kAsIs, 0, change, {r1, "2:0::0:0:0:5:30:0"}, reload_failed},
-      {rule_delete_v1, ids, kAsIs, 0, {"KOVAPerfEventConfDelete 1", kReload}, {r2}, reload_failed},
-      {rule_delete_v1, R"({"id_list": []})", kAsIs, 0, {kReload}, seeded, reload_failed},
-      {rule_onoff_v1, mixed, kAsIs, 0, walk, {switched_1, switched_2}, invalid},
-      {rule_onoff_v1, both, kStoreFails, 0, walk, seeded, failed},
-      {rule_onoff_v1, both, kNoList, 0, {kGet1, get2, kReload}, seeded, reload_failed},
-      {rule_onoff_v1, both, kEmptyList, 0, empty_walk, seeded, reload_failed},
-  };
-  for (const auto& [handler, params, arrange, code, calls, stored, log] : cases) {
-    kova_fake::Reset();
-    Seed(0, "x", 0);
-    Seed(0, "y", 1);
-    kova_fake::FailService("kovaperfeventd", "reload", -1);
-    arrange();
-    KOVA::APIResponse response = CallHandler(handler, params);
-    EXPECT_EQ(response.GetSettleCount(), 1) << params;
-    EXPECT_EQ(response.GetErrorCode(), code) << params;
-    EXPECT_EQ(response.GetData(), code == 0 || code == 101 ? Json::Value() : earlier) << params;
-    EXPECT_THAT(kova_fake::Calls(), ::testing::ElementsAreArray(calls)) << params;
-    EXPECT_EQ(StoredRules(), stored) << params;
-    EXPECT_EQ(ErrorLog(), log) << params;
-    ExpectListsFreed(params);
-  }
+  RunHandlerRows(rule_onoff_v1,
+                 {
+                     {R"({"id_list": {"id": "1", "enable": true}})", kAsIs, 101, kSeeded, {}},
+                     {mixed, kAsIs, 0, {kOn1, kOff2}, invalid},
+                     {both, kStoreFails, 0, kSeeded, failed},
+                     {both, kNoList, 0, kSeeded, kReloadFailedLog},
+                     {both, kEmptyList, 0, kSeeded, kReloadFailedLog},
+                 });
 }
 
 // What a handler's answer shows: the ids of a page, or the id of a rule.
@@ -246,60 +286,58 @@ std::string Shown(const Json::Value& data) {
 // Rules 1 (off) and 2 (on) are stored first. A parameter converts as the JSON
 // library converts it; 101 answers only one that the library refuses.
 TEST_F(EventRuleTest, ParametersConvertAsTheJsonLibraryDoes) {
-  const std::string r1 = "1:0:x:1:2:80:1:2:0", r2 = "2:0:y:1:2:80:1:2:1";
-  const Strings seeded = {r1, r2};
-  // handler, params, code (0: success), what the answer shows, store afterwards
-  const std::tuple<APIHandler, const char*, int, const char*, Strings> cases[] = {
-      {rule_get_v1, R"({"id": 2})", 0, "2", seeded},
-      {rule_get_v1, R"({"id": true})", 6102, "", seeded},  // the text "true" names no rule
-      {rule_get_v1, R"({"id": ["2"]})", 101, "", seeded},
-      {rule_get_v1, R"({"id": {}})", 101, "", seeded},
+  const struct {
+    APIHandler handler;
+    const char* params;
+    int code;           // 0: success
+    const char* shown;  // the ids of a page, or the id of a rule
+    Rules stored;
+  } cases[] = {
+      {rule_get_v1, R"({"id": 2})", 0, "2", kSeeded},
+      {rule_get_v1, R"({"id": true})", 6102, "", kSeeded},  // the text "true" names no rule
+      {rule_get_v1, R"({"id": ["2"]})", 101, "", kSeeded},
+      {rule_get_v1, R"({"id": {}})", 101, "", kSeeded},
       {rule_set_v1,
        R"({"id": 1, "enable": 1, "service": 7, "type": 1.9, "severity": true, "resource": -0.5,
            "threshold": 90.0})",
        0,
        "",
-       {"1:1:7:0:1:90:5:30:1", r2}},
+       {{"1", 1, "7", 0, 1, 90, 5, 30, 1}, kOn2}},
       {rule_set_v1,
        R"({"enable": null, "service": false, "type": null})",
        0,
        "",
-       {r1, r2, "3:0:false:0:0:0:5:30:0"}},
-      {rule_set_v1, R"({"id": 2, "enable": "true"})", 101, "", seeded},
-      {rule_set_v1, R"({"enable": [true]})", 101, "", seeded},
-      {rule_set_v1, R"({"service": {"name": "smb"}})", 101, "", seeded},
-      {rule_set_v1, R"({"resource": "1"})", 101, "", seeded},
-      {rule_set_v1, R"({"threshold": 2147483648})", 101, "", seeded},
-      {rule_set_v1, R"({"severity": -2147483649})", 101, "", seeded},
-      {rule_set_v1, R"({"type": 1e300})", 101, "", seeded},
-      {rule_set_v1, R"({"id": [1]})", 101, "", seeded},
+       {kOff1, kOn2, {"3", 0, "false", 0, 0, 0, 5, 30, 0}}},
+      {rule_set_v1, R"({"id": 2, "enable": "true"})", 101, "", kSeeded},
+      {rule_set_v1, R"({"enable": [true]})", 101, "", kSeeded},
+      {rule_set_v1, R"({"service": {"name": "smb"}})", 101, "", kSeeded},
+      {rule_set_v1, R"({"resource": "1"})", 101, "", kSeeded},
+      {rule_set_v1, R"({"threshold": 2147483648})", 101, "", kSeeded},
+      {rule_set_v1, R"({"severity": -2147483649})", 101, "", kSeeded},
+      {rule_set_v1, R"({"type": 1e300})", 101, "", kSeeded},
+      {rule_set_v1, R"({"id": [1]})", 101, "", kSeeded},
       {rule_onoff_v1,
        R"({"id_list": [{"id": 2, "enable": 0}, {"id": "1", "enable": 1}]})",
        0,
        "",
-       {"1:0:x:1:2:80:1:2:1", "2:0:y:1:2:80:1:2:0"}},
-      {rule_onoff_v1,
-       R"({"id_list": [{"id": "2", "enable": null}]})",
-       0,
-       "",
-       {r1, "2:0:y:1:2:80:1:2:0"}},
-      {rule_list_v1, R"({"offset": true, "limit": 1.5})", 0, "2 ", seeded},
-      {rule_list_v1, R"({"offset": "1"})", 101, "", seeded},
-      {rule_list_v1, R"({"limit": 1e300})", 101, "", seeded},
+       {kOn1, kOff2}},
+      {rule_onoff_v1, R"({"id_list": [{"id": "2", "enable": null}]})", 0, "", {kOff1, kOff2}},
+      {rule_list_v1, R"({"offset": true, "limit": 1.5})", 0, "2 ", kSeeded},
+      {rule_list_v1, R"({"offset": "2"})", 101, "", kSeeded},
+      {rule_list_v1, R"({"offset": "1"})", 101, "", kSeeded},
+      {rule_list_v1, R"({"limit": 1e300})", 101, "", kSeeded},
   };
-  for (const auto& [handler, params, code, shown, stored] : cases) {
+  for (const auto& c : cases) {
     kova_fake::Reset();
-    Seed(0, "x", 0);
-    Seed(0, "y", 1);
-    const KOVA::APIResponse response = CallHandler(handler, params);
-    EXPECT_EQ(response.GetErrorCode(), code) << params;
-    EXPECT_EQ(Shown(response.GetData()), shown) << params;
-    EXPECT_EQ(StoredRules(), stored) << params;
-    if (code == 101) {
-      EXPECT_EQ(response.GetData(), Json::Value()) << params;
-      EXPECT_THAT(kova_fake::Calls(), ::testing::IsEmpty()) << params;
+    SeedTwo();
+    const KOVA::APIResponse response = CallHandler(c.handler, c.params);
+    EXPECT_EQ(response.GetErrorCode(), c.code) << c.params;
+    EXPECT_EQ(Shown(response.GetData()), c.shown) << c.params;
+    EXPECT_EQ(StoredRules(), c.stored) << c.params;
+    if (c.code == 101) {
+      EXPECT_EQ(response.GetData(), Json::Value()) << c.params;
     }
-    ExpectListsFreed(params);
+    ExpectListsFreed(c.params);
   }
 }
 

@@ -4,7 +4,6 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <string>
 #include <vector>
 
@@ -17,12 +16,9 @@ namespace {
 
 using kova_test::ParseJson;
 using ::testing::ElementsAreArray;
-using ::testing::UnorderedElementsAreArray;
 
 constexpr int64_t kDay1 = 1700000000;
 const std::string kTime1 = KOVALogConvertTime1(kDay1);
-const std::string kTime2 = KOVALogConvertTime1(kDay1 + 86400);
-const std::string kTime3 = KOVALogConvertTime1(kDay1 + 2 * 86400);
 
 std::string Line(const std::string& level, const std::string& time, const std::string& event) {
   return "7\t" + level + "\t" + time + "\tadmin\tkovaperfeventd\t" + event;
@@ -129,41 +125,6 @@ TEST(LogReaderTest, SplitsLinesLikeTokenisingAtTabs) {
   for (const auto& c : cases) {
     EXPECT_THAT(Read(c.lines), ElementsAreArray(c.entries)) << ::testing::PrintToString(c.lines);
     EXPECT_THAT(WrongLogLines(), ElementsAreArray(c.wrong)) << ::testing::PrintToString(c.lines);
-  }
-}
-
-TEST(LogReaderTest, FiltersByKeywordLevelAndInclusiveTimeBounds) {
-  const std::vector<std::string> lines = {
-      Line("Warning", kTime1, "CPU of Café above 80%"),
-      Line("warn", kTime2, "memory"),
-      Line("CRITICAL", kTime3, "io latency"),
-      Line("Warnings", kTime2, "cpu"),
-      Line("Info", kTime1, ""),
-  };
-  const std::string day2 = std::to_string(kDay1 + 86400);
-  const struct {
-    std::string filter;
-    std::vector<std::string> events;
-  } cases[] = {
-      {"{}", {"io latency", "memory", "cpu", "CPU of Café above 80%", ""}},
-      {R"({"keyword": "cafÉ"})", {"CPU of Café above 80%"}},
-      {R"({"keyword": "CPU"})", {"cpu", "CPU of Café above 80%"}},
-      // The line's level must occur within the requested level's name.
-      {R"({"loglevel": "Warning"})", {"memory", "CPU of Café above 80%"}},
-      {R"({"loglevel": "Critical"})", {"io latency"}},
-      {R"({"datefrom": )" + day2 + R"(, "dateto": )" + day2 + "}", {"memory", "cpu"}},
-      {R"({"datefrom": )" + day2 + "}", {"io latency", "memory", "cpu"}},
-      {R"({"dateto": )" + std::to_string(kDay1) + R"(, "loglevel": "Warning"})",
-       {"CPU of Café above 80%"}},
-  };
-  for (const auto& c : cases) {
-    std::vector<std::string> events, times;
-    for (const auto& entry : Read(lines, c.filter.c_str())) {
-      events.push_back(entry["event"].asString());
-      times.push_back(entry["time"].asString());
-    }
-    EXPECT_THAT(events, UnorderedElementsAreArray(c.events)) << c.filter;
-    EXPECT_TRUE(std::is_sorted(times.rbegin(), times.rend())) << c.filter;  // newest first
   }
 }
 

@@ -6,6 +6,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <functional>
@@ -24,9 +25,12 @@ using kova_test::CallHandler;
 using kova_test::ParseJson;
 using State = KOVA::APIResponse::State;
 
-const std::string kTime1 = KOVALogConvertTime1(1700000000);
-const std::string kTime2 = KOVALogConvertTime1(1700000060);
-const std::string kTime3 = KOVALogConvertTime1(1700000120);
+constexpr int64_t kDay1 = 1700000000;
+// The time text of day `n` (1 to 5).
+std::string Day(int n) { return KOVALogConvertTime1(kDay1 + (n - 1) * 86400); }
+const std::string kTime1 = Day(1);
+const std::string kTime2 = Day(2);
+const std::string kTime3 = Day(3);
 
 std::string Line(const std::string& level, const std::string& time, const std::string& event) {
   return "1\t" + level + "\t" + time + "\tadmin\tkovaperfeventd\t" + event;
@@ -54,27 +58,42 @@ class LogApiTest : public ::testing::Test {
  protected:
   void SetUp() override {
     kova_fake::Reset();
-    kova_fake::SetLogLines({Line("Warning", kTime1, "a"), Line("Critical", kTime2, "b"),
-                            Line("Warning", kTime3, "c")});
+    kova_fake::SetLogLines({Line("Warning", Day(1), "CPU of Café above 80%"),
+                            Line("warn", Day(2), "memory"), Line("Info", Day(3), ""),
+                            Line("Warnings", Day(4), "cpu"), Line("CRITICAL", Day(5), "io")});
   }
 };
 
-TEST_F(LogApiTest, ListPagesNewestFirst) {
+// Each filter and each page bound once: the page holds the matching entries
+// newest first, and "total" counts them all.
+TEST_F(LogApiTest, ListFiltersAndPagesNewestFirst) {
+  const std::string day2 = std::to_string(kDay1 + 86400);
+  const std::string day4 = std::to_string(kDay1 + 3 * 86400);
+  const std::string all[] = {"io", "cpu", "", "memory", "CPU of Café above 80%"};
   const struct {
-    const char* params;
+    std::string params;
     std::vector<std::string> events;
     unsigned total;
   } cases[] = {
-      {"{}", {"c", "b", "a"}, 3},
-      {R"({"offset": 1, "limit": 1})", {"b"}, 3},
-      {R"({"offset": 2, "limit": 5})", {"a"}, 3},
-      {R"({"limit": 0})", {}, 3},
-      {R"({"limit": -7, "filter": null})", {"c", "b", "a"}, 3},
-      {R"({"limit": 1e12, "offset": true})", {"b", "a"}, 3},
-      {R"({"offset": 3})", {}, 3},
-      {R"({"offset": 4294967296})", {}, 3},
-      {R"({"offset": -1, "limit": 2})", {}, 3},
-      {R"({"filter": {"loglevel": "Warning"}, "limit": 1})", {"c"}, 2},
+      {"{}", {all, all + 5}, 5},
+      {R"({"offset": 1, "limit": 2})", {"cpu", ""}, 5},
+      {R"({"offset": 3, "limit": 5})", {"memory", "CPU of Café above 80%"}, 5},
+      {R"({"limit": 0})", {}, 5},
+      {R"({"limit": -7, "filter": null})", {all, all + 5}, 5},
+      {R"({"limit": 1e12, "offset": true})", {all + 1, all + 5}, 5},
+      {R"({"offset": 5})", {}, 5},
+      {R"({"offset": 4294967296})", {}, 5},
+      {R"({"offset": -1, "limit": 2})", {}, 5},
+      {R"({"filter": {"keyword": "cafÉ"}})", {"CPU of Café above 80%"}, 1},
+      {R"({"filter": {"keyword": "CPU"}, "limit": 1})", {"cpu"}, 2},
+      // The line's level must occur within the requested level's name.
+      {R"({"filter": {"loglevel": "Warning"}})", {"memory", "CPU of Café above 80%"}, 2},
+      {R"({"filter": {"loglevel": "Critical"}})", {"io"}, 1},
+      {R"({"filter": {"datefrom": )" + day2 + R"(, "dateto": )" + day2 + "}}", {"memory"}, 1},
+      {R"({"filter": {"datefrom": )" + day4 + "}}", {"io", "cpu"}, 2},
+      {R"({"filter": {"dateto": )" + day2 + R"(, "loglevel": "Warning"}, "offset": 1})",
+       {"CPU of Café above 80%"},
+       2},
   };
   for (const auto& c : cases) {
     const KOVA::APIResponse response = CallHandler(log_list_v1, c.params);

@@ -9,6 +9,7 @@
 
 #include "api/critical_section.h"
 #include "api/error_report.h"
+#include "api/page.h"
 #include "kova/conf.h"
 #include "kova/error.h"
 #include "kova/service.h"
@@ -142,17 +143,6 @@ Json::Value RuleObject(const std::string& language, const KOVAPERFEVENT_CONF_SET
   return rule;
 }
 
-// The rules of the page from `offset`, at most `limit` of them when it is positive.
-Json::Value Page(const std::vector<Json::Value>& rules, int64_t offset, int64_t limit) {
-  Json::Value page(Json::arrayValue);
-  if (offset < 0 || limit == 0) return page;
-  for (size_t i = static_cast<size_t>(offset); i < rules.size(); ++i) {
-    if (limit > 0 && page.size() == static_cast<uint64_t>(limit)) break;
-    page.append(rules[i]);
-  }
-  return page;
-}
-
 // A failed reload is logged; the rules are stored all the same.
 void ReloadDaemon() {
   if (QLIBServiceReload(kDaemon) == 0) return;
@@ -270,7 +260,7 @@ void rule_list_v1(KOVA::APIRequest* request, KOVA::APIResponse* response) {
   ListEventRules(request->GetUILanguage(), rules);
   Json::Value data;
   data["total"] = static_cast<Json::UInt>(rules.size());
-  data["rules"] = Page(rules, offset, limit);
+  data["rules"] = Page(rules.size(), offset, limit, [&rules](size_t i) { return rules[i]; });
   data["support_internal"] = QLIBCFileCheckKeyValue(kKovaInfoConf, kSupportInternalKey, "yes", 0);
   response->SetSuccess(data);
 }

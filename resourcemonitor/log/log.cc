@@ -4,6 +4,7 @@
 
 #include "api/critical_section.h"
 #include "api/error_report.h"
+#include "api/page.h"
 #include "kova/log.h"
 #include "log/log_reader.h"
 
@@ -37,18 +38,6 @@ bool ParseListRequest(const KOVA::APIRequest& request, LogFilter& filter) {
   return ParseLogFilter(request.GetParam("filter", Json::Value()), offset, limit, filter);
 }
 
-// The page of `records` that starts at `offset` and holds at most `limit`
-// entries (all when negative).
-Json::Value Page(const LogRecords& records, int offset, int limit) {
-  Json::Value logs(Json::arrayValue);
-  if (offset < 0 || limit == 0) return logs;
-  for (size_t i = static_cast<size_t>(offset); i < records.size(); ++i) {
-    if (limit > 0 && logs.size() == static_cast<unsigned>(limit)) break;
-    logs.append(records.Entry(i));
-  }
-  return logs;
-}
-
 }  // namespace
 
 void log_list_v1(KOVA::APIRequest* request, KOVA::APIResponse* response) {
@@ -61,7 +50,8 @@ void log_list_v1(KOVA::APIRequest* request, KOVA::APIResponse* response) {
   const bool read = ProcessLogRecords(filter, records);
   Json::Value reply;
   reply["total"] = static_cast<Json::UInt>(records.size());
-  reply["logs"] = Page(records, filter.offset, filter.limit);
+  reply["logs"] = Page(records.size(), filter.offset, filter.limit,
+                       [&records](size_t i) { return records.Entry(i); });
   // An unreadable log is answered with the error record as it stands, beside
   // the empty page.
   if (!read) return SetErrorFromReport(response, reply);

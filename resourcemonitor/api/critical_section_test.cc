@@ -5,10 +5,14 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <fstream>
 #include <string>
 #include <vector>
 
+#include "eventrule/EventRule.h"
 #include "fake/kova_fake.h"
+#include "log/log.h"
+#include "test_support/host_call.h"
 #include "test_support/run_in_child.h"
 
 namespace {
@@ -119,6 +123,62 @@ TEST_F(CriticalSectionTest, LogsAndGoesOnWhenTheProcessCannotRaise) {
                 ElementsAre(Error("log:6 ERROR: setresuid(-1, 0, -1) [Operation not permitted]"),
                             Error("log:6 ERROR: LEAVECriticalSection")));
   }));
+}
+
+// The line numbers of the first "ENTERCriticalSection(" and the first
+// "LEAVECriticalSection(" after `function` in the module source `file`.
+std::pair<int, int> SectionLines(const std::string& file, const std::string& function) {
+  std::ifstream source(std::string(KOVA_RESOURCEMONITOR_DIR) + "/" + file);
+  EXPECT_TRUE(source.is_open()) << file;
+  int enter = 0, leave = 0, number = 0;
+  bool inside = false;
+  for (std::string line; std::getline(source, line) && leave == 0;) {
+    ++number;
+    inside = inside || line.find(function) != std::string::npos;
+    if (inside && enter == 0 && line.find("ENTERCriticalSection(") != std::string::npos) {
+      enter = number;
+    }
+    if (enter != 0 && line.find("LEAVECriticalSection(") != std::string::npos) leave = number;
+  }
+  EXPECT_NE(leave, 0) << function << " in " << file;
+  return {enter, leave};
+}
+
+// A handler that enters the section logs its source's name and the line of the
+// call it made, on entry and on leaving.
+TEST_F(CriticalSectionTest, CallSitesLogTheirOwnSourceAndLine) {
+  const struct {
+    APIHandler handler;
+    const char* params;
+    const char* source;
+    const char* file;
+    const char* function;
+  } cases[] = {
+      {log_clear_v1, "{}", "log", "log/log.cc", "void log_clear_v1("},
+      {log_list_v1, "{}", "log", "log/log_reader.cc", "bool ReadLog("},
+      {rule_set_v1, R"({"service": "x"})", "EventRule", "eventrule/EventRule.cc",
+       "void rule_set_v1("},
+      {rule_delete_v1, R"({"id_list": []})", "EventRule", "eventrule/EventRule.cc",
+       "void rule_delete_v1("},
+      {rule_onoff_v1, R"({"id_list": []})", "EventRule", "eventrule/EventRule.cc",
+       "void rule_onoff_v1("},
+  };
+  for (const auto& c : cases) {
+    const auto [enter, leave] = SectionLines(c.file, c.function);
+    kova_fake::Reset();
+    kova_fake::SetLogLines({});
+    ASSERT_EQ(setresuid(-1, kNobody, -1), 0);
+    kova_test::CallHandler(c.handler, c.params);
+    ASSERT_EQ(setresuid(-1, 0, -1), 0);
+    std::vector<std::string> warnings;
+    for (const SyslogLine& line : kova_fake::Syslog()) {
+      if (line.text.find(" WARNING: ") != std::string::npos) warnings.push_back(line.text);
+    }
+    const std::string raise = " WARNING: setresuid(-1, 0, -1)";
+    EXPECT_THAT(warnings, ElementsAre(c.source + (":" + std::to_string(enter)) + raise,
+                                      c.source + (":" + std::to_string(leave)) + raise))
+        << c.function;
+  }
 }
 
 }  // namespace

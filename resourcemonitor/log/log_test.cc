@@ -179,9 +179,13 @@ TEST_F(LogApiTest, ExportWritesTheDownloadByteForByte) {
     std::string filter;
     std::vector<std::string> lines;
     std::string body;
+    bool unreadable = false;
   } cases[] = {
       {"csv", "null", {}, ""},
       {"html", "null", {}, head + "</body></html>"},
+      // A log that can't be fetched is exported as an empty one.
+      {"csv", "null", lines, "", true},
+      {"html", "null", lines, head + "</body></html>", true},
       {"csv", "null", lines,
        "Time,Level,Event,\r\n" + kTime3 + ",Info,\xc5\x89, grows,\r\n" + kTime2 +
            ",Critical,say \"hi\",\r\n" + kTime1 + ",Warning,\"cpu, 91% <high> \"x\"\",\r\n"},
@@ -193,6 +197,7 @@ TEST_F(LogApiTest, ExportWritesTheDownloadByteForByte) {
   };
   for (const auto& c : cases) {
     kova_fake::SetLogLines(c.lines);
+    kova_fake::FailLogFetch(c.unreadable);
     const std::string& type = c.type;
     KOVA::APIResponse response;
     char before[64], after[64];
@@ -225,6 +230,31 @@ TEST(LogExportTest, QuotesCsvCellsWithACommaOnly) {
       {true, "a,<b>", "a,&lt;b&gt;"},    {true, "\"q\"", "&quot;q&quot;"},
   };
   for (const auto& c : cases) EXPECT_EQ(FormatExportCell(c.html, c.text), c.cell) << c.text;
+}
+
+// Every column of a row goes through the same cell format.
+TEST(LogExportTest, EscapesEveryColumn) {
+  const std::string text = "a,<b>";
+  const struct {
+    int column;  // 0 time, 1 level, 2 event
+    std::string csv_row;
+    std::string html_row;
+  } cases[] = {
+      {0, "\"a,<b>\",Warning,e,\r\n", "<tr><td>a,&lt;b&gt;</td><td>Warning</td><td>e</td></tr>\n"},
+      {1, "t,\"a,<b>\",e,\r\n", "<tr><td>t</td><td>a,&lt;b&gt;</td><td>e</td></tr>\n"},
+      {2, "t,Warning,\"a,<b>\",\r\n", "<tr><td>t</td><td>Warning</td><td>a,&lt;b&gt;</td></tr>\n"},
+  };
+  for (const auto& c : cases) {
+    std::string fields[] = {"t", "Warning", "e"};
+    fields[c.column] = text;
+    kova_fake::Reset();
+    kova_fake::SetLogLines({Line(fields[1], fields[0], fields[2])});
+    const std::string csv = CaptureOutput([] { CallHandler(log_export_v1, R"({"type": "csv"})"); });
+    const std::string html =
+        CaptureOutput([] { CallHandler(log_export_v1, R"({"type": "html"})"); });
+    EXPECT_THAT(csv, ::testing::EndsWith(c.csv_row)) << c.column;
+    EXPECT_THAT(html, ::testing::HasSubstr(c.html_row)) << c.column;
+  }
 }
 
 }  // namespace

@@ -11,7 +11,7 @@
 
 #include "eventrule/EventRule.h"
 #include "fake/kova_fake.h"
-#include "log/log.h"
+#include "log/log_handlers.h"
 #include "test_support/host_call.h"
 #include "test_support/run_in_child.h"
 
@@ -154,7 +154,7 @@ TEST_F(CriticalSectionTest, CallSitesLogTheirOwnSourceAndLine) {
     const char* file;
     const char* function;
   } cases[] = {
-      {log_clear_v1, "{}", "log", "log/log.cc", "void log_clear_v1("},
+      {log_clear_v1, "{}", "log", "log/log_handlers.cc", "void log_clear_v1("},
       {log_list_v1, "{}", "log", "log/log_reader.cc", "bool ReadLog("},
       {rule_set_v1, R"({"service": "x"})", "EventRule", "eventrule/EventRule.cc",
        "void rule_set_v1("},

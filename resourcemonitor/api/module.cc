@@ -1,7 +1,7 @@
 #include "api/module.h"
 
 #include "eventrule/EventRule.h"
-#include "log/log.h"
+#include "log/log_handlers.h"
 #include "setting/resource_api.h"
 
 namespace {

@@ -12,7 +12,7 @@
 
 #include "fake/kova_fake.h"
 #include "kova/log.h"
-#include "log/log.h"
+#include "log/log_handlers.h"
 #include "test_support/host_call.h"
 
 namespace {

@@ -8,7 +8,7 @@
 #include "api/error_report.h"
 #include "api/module.h"
 #include "kova/text.h"
-#include "log/log.h"
+#include "log/log_handlers.h"
 #include "log/log_reader.h"
 
 namespace {

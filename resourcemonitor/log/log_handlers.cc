@@ -1,4 +1,4 @@
-#include "log/log.h"
+#include "log/log_handlers.h"
 
 #include <climits>
 

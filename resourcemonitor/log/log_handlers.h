@@ -1,8 +1,8 @@
 // The methods of "KOVA.ResourceMonitor.Log": list, clear and export of the
 // performance-event log.
 
-#ifndef RESOURCEMONITOR_LOG_LOG_H_
-#define RESOURCEMONITOR_LOG_LOG_H_
+#ifndef RESOURCEMONITOR_LOG_LOG_HANDLERS_H_
+#define RESOURCEMONITOR_LOG_LOG_HANDLERS_H_
 
 #include <string>
 
@@ -18,4 +18,4 @@ void log_export_v1(KOVA::APIRequest* request, KOVA::APIResponse* response);
 // double quotes when it holds a comma.
 std::string FormatExportCell(bool html, const std::string& text);
 
-#endif  // RESOURCEMONITOR_LOG_LOG_H_
+#endif  // RESOURCEMONITOR_LOG_LOG_HANDLERS_H_

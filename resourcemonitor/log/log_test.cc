@@ -219,19 +219,6 @@ TEST_F(LogApiTest, ExportWritesTheDownloadByteForByte) {
   tzset();
 }
 
-TEST(LogExportTest, QuotesCsvCellsWithACommaOnly) {
-  const struct {
-    bool html;
-    const char* text;
-    const char* cell;
-  } cases[] = {
-      {false, "a,b", "\"a,b\""},         {false, "say \"hi\"", "say \"hi\""}, {false, "", ""},
-      {false, "\xc5\x89,", "\xc5\x89,"},  // upper case grows
-      {true, "a,<b>", "a,&lt;b&gt;"},    {true, "\"q\"", "&quot;q&quot;"},
-  };
-  for (const auto& c : cases) EXPECT_EQ(FormatExportCell(c.html, c.text), c.cell) << c.text;
-}
-
 // Every column of a row goes through the same cell format.
 TEST(LogExportTest, EscapesEveryColumn) {
   const std::string text = "a,<b>";

@@ -19,7 +19,7 @@
 
 #include "fake/kova_fake.h"
 #include "kova/log.h"
-#include "log/log.h"
+#include "log/log_handlers.h"
 #include "log/log_reader.h"
 #include "test_support/host_call.h"
 

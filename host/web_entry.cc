@@ -4,6 +4,7 @@
 #include <map>
 #include <set>
 
+#include "common/answer_envelope.h"
 #include "host/cgi_output.h"
 #include "host/host_log.h"
 #include "host/json_text.h"
@@ -198,7 +199,7 @@ EntryReply WebEntry::Info() const {
   }
   Json::Value data;
   data["apis"] = list;
-  return Json(SuccessEnvelope(data));
+  return Json(kova::SuccessEnvelope(data));
 }
 
 std::optional<EntryReply> WebEntry::SignIn(const CallPtr& call_ptr) {
@@ -220,7 +221,7 @@ std::optional<EntryReply> WebEntry::SignIn(const CallPtr& call_ptr) {
     Json::Value errors;
     errors["reason"] = "too many failed sign-ins; try again later";
     errors["retry_after"] = wait;
-    EntryReply reply = Json(ErrorEnvelope(kErrorSignInThrottled, errors));
+    EntryReply reply = Json(kova::ErrorEnvelope(kErrorSignInThrottled, errors));
     reply.headers.emplace_back("Retry-After", std::to_string(wait));
     return reply;
   }
@@ -251,7 +252,7 @@ EntryReply WebEntry::CheckPassword(Call& call, const std::vector<std::string>& k
   data["token"] = session.token;
   data["account"] = *account;
   data["admin"] = admin;
-  EntryReply reply = Json(SuccessEnvelope(data));
+  EntryReply reply = Json(kova::SuccessEnvelope(data));
   reply.headers.emplace_back("Set-Cookie", SessionCookie(sid));
   return reply;
 }
@@ -262,7 +263,7 @@ EntryReply WebEntry::SignOut(Call& call) {
   EntryReply refused;
   if (!FindSession(call, sid, session, refused)) return refused;
   sessions_.Remove(sid);
-  EntryReply reply = Json(SuccessEnvelope(Json::Value()));
+  EntryReply reply = Json(kova::SuccessEnvelope(Json::Value()));
   reply.headers.emplace_back("Set-Cookie", SessionCookie(""));
   return reply;
 }

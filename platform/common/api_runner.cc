@@ -5,6 +5,7 @@
 #include <string>
 #include <tuple>
 
+#include "common/answer_envelope.h"
 #include "kova/webapi.h"
 
 namespace KOVA {
@@ -47,25 +48,14 @@ int Find(const MethodKey& key, Method& found) {
   return version_known ? kAPIErrorNoSuchMethod : kAPIErrorBadVersion;
 }
 
-Json::Value Failure(int code, const Json::Value& errors) {
-  Json::Value out;
-  out["success"] = false;
-  out["error"]["code"] = code;
-  if (!errors.isNull()) out["error"]["errors"] = errors;
-  return out;
-}
-
 Json::Value Answer(const APIResponse& response) {
   if (!response.IsOutputEnabled() || response.GetState() == APIResponse::State::kUnset) {
-    return Failure(kAPIErrorUnknown, Json::Value());
+    return kova::ErrorEnvelope(kAPIErrorUnknown, Json::Value());
   }
   if (response.GetState() == APIResponse::State::kError) {
-    return Failure(response.GetErrorCode(), response.GetData());
+    return kova::ErrorEnvelope(response.GetErrorCode(), response.GetData());
   }
-  Json::Value out;
-  out["success"] = true;
-  if (!response.GetData().isNull()) out["data"] = response.GetData();
-  return out;
+  return kova::SuccessEnvelope(response.GetData());
 }
 
 }  // namespace
@@ -87,16 +77,16 @@ int APIRunner::Exec(Json::Value& out, const char* api, int version, const char* 
   try {
     const int refused = Call(api, version, method, request, response);
     if (refused == kAPIErrorNotPermitted) {
-      out = Failure(refused, Json::Value());
+      out = kova::ErrorEnvelope(refused, Json::Value());
       return 0;
     }
     if (refused != 0) {
-      out = Failure(refused, Json::Value());
+      out = kova::ErrorEnvelope(refused, Json::Value());
       return -1;
     }
     out = Answer(response);
   } catch (...) {
-    out = Failure(kAPIErrorUnknown, Json::Value());
+    out = kova::ErrorEnvelope(kAPIErrorUnknown, Json::Value());
   }
   return 0;
 }

@@ -5,6 +5,7 @@
 #include <set>
 
 #include "common/answer_envelope.h"
+#include "common/method_list.h"
 #include "host/cgi_output.h"
 #include "host/host_log.h"
 #include "host/json_text.h"
@@ -301,18 +302,11 @@ bool WebEntry::FindSession(Call& call, std::string& sid, Session& session, Entry
 
 std::optional<EntryReply> WebEntry::RunModule(const CallPtr& call_ptr) {
   Call& call = *call_ptr;
-  const std::shared_ptr<const Json::Value> methods = runners_.Methods();
-  bool api_known = false, version_known = false, method_known = false;
-  for (const Json::Value& row : *methods) {
-    if (row["api"].asString() != call.api) continue;
-    api_known = true;
-    if (row["version"].asInt() != call.version) continue;
-    version_known = true;
-    method_known = method_known || row["method"].asString() == call.method;
-  }
-  if (!api_known) return Error(KOVA::kAPIErrorNoSuchAPI, "no such API");
-  if (!version_known) return Error(KOVA::kAPIErrorBadVersion, "no such version");
-  if (!method_known) return Error(KOVA::kAPIErrorNoSuchMethod, "no such method");
+  const int missing =
+      kova::FindInMethodList(*runners_.Methods(), call.api, call.version, call.method);
+  if (missing == KOVA::kAPIErrorNoSuchAPI) return Error(missing, "no such API");
+  if (missing == KOVA::kAPIErrorBadVersion) return Error(missing, "no such version");
+  if (missing != 0) return Error(missing, "no such method");
 
   std::string sid;
   Session session;

@@ -6,6 +6,7 @@
 #include <tuple>
 
 #include "common/answer_envelope.h"
+#include "common/method_list.h"
 #include "kova/webapi.h"
 
 namespace KOVA {
@@ -28,6 +29,19 @@ Registry& TheRegistry() {
   return registry;
 }
 
+// Every method of `methods` as {"api", "version", "method"}, in their order.
+Json::Value ListOf(const std::map<MethodKey, Method>& methods) {
+  Json::Value list(Json::arrayValue);
+  for (const auto& [key, unused] : methods) {
+    Json::Value row;
+    row["api"] = std::get<0>(key);
+    row["version"] = std::get<1>(key);
+    row["method"] = std::get<2>(key);
+    list.append(row);
+  }
+  return list;
+}
+
 // The registered method, or the host error that says why there is none.
 int Find(const MethodKey& key, Method& found) {
   Registry& registry = TheRegistry();
@@ -38,14 +52,7 @@ int Find(const MethodKey& key, Method& found) {
     return 0;
   }
   const auto& [api, version, method] = key;
-  bool api_known = false;
-  bool version_known = false;
-  for (const auto& [other, unused] : registry.methods) {
-    api_known = api_known || std::get<0>(other) == api;
-    version_known = version_known || (std::get<0>(other) == api && std::get<1>(other) == version);
-  }
-  if (!api_known) return kAPIErrorNoSuchAPI;
-  return version_known ? kAPIErrorNoSuchMethod : kAPIErrorBadVersion;
+  return kova::FindInMethodList(ListOf(registry.methods), api, version, method);
 }
 
 Json::Value Answer(const APIResponse& response) {
@@ -94,15 +101,7 @@ int APIRunner::Exec(Json::Value& out, const char* api, int version, const char* 
 Json::Value APIRunner::List() {
   Registry& registry = TheRegistry();
   std::lock_guard lock(registry.mutex);
-  Json::Value list(Json::arrayValue);
-  for (const auto& [key, unused] : registry.methods) {
-    Json::Value row;
-    row["api"] = std::get<0>(key);
-    row["version"] = std::get<1>(key);
-    row["method"] = std::get<2>(key);
-    list.append(row);
-  }
-  return list;
+  return ListOf(registry.methods);
 }
 
 int APIRunner::Register(const APITableEntry* table, const APICheckEntry* checks) {

@@ -7,6 +7,8 @@
 #include <memory>
 #include <sstream>
 
+#include "common/answer_envelope.h"
+
 namespace kova_host {
 
 std::string ToJson(const Json::Value& value) {
@@ -49,25 +51,10 @@ bool FromJson(std::string_view text, Json::Value& value) {
   return ParseJsonText(text, value, kMaxJsonDepth) == JsonParse::kOk;
 }
 
-Json::Value SuccessEnvelope(const Json::Value& data) {
-  Json::Value out;
-  out["success"] = true;
-  if (!data.isNull()) out["data"] = data;
-  return out;
-}
-
-Json::Value ErrorEnvelope(int code, const Json::Value& errors) {
-  Json::Value out;
-  out["success"] = false;
-  out["error"]["code"] = code;
-  if (!errors.isNull()) out["error"]["errors"] = errors;
-  return out;
-}
-
 Json::Value ErrorReason(int code, const std::string& reason) {
   Json::Value errors;
   errors["reason"] = reason;
-  return ErrorEnvelope(code, errors);
+  return kova::ErrorEnvelope(code, errors);
 }
 
 }  // namespace kova_host

@@ -1,4 +1,4 @@
-// JSON text in and out, and the envelope every web-API answer travels in.
+// JSON text in and out, and the error envelope that carries a reason.
 
 #ifndef KOVA_HOST_JSON_TEXT_H_
 #define KOVA_HOST_JSON_TEXT_H_
@@ -27,10 +27,6 @@ JsonParse ParseJsonText(std::string_view text, Json::Value& value, int max_depth
 // ParseJsonText at kMaxJsonDepth; false when `text` is no such value.
 bool FromJson(std::string_view text, Json::Value& value);
 
-// {"success": true, "data": DATA}, "data" left out when null.
-Json::Value SuccessEnvelope(const Json::Value& data);
-// {"success": false, "error": {"code": CODE, "errors": ERRORS}}, "errors" left out when null.
-Json::Value ErrorEnvelope(int code, const Json::Value& errors);
 // An error envelope whose "errors" is {"reason": reason}.
 Json::Value ErrorReason(int code, const std::string& reason);
 

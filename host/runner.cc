@@ -13,6 +13,7 @@
 #include <cstring>
 #include <exception>
 
+#include "common/answer_envelope.h"
 #include "host/host_log.h"
 #include "host/json_text.h"
 #include "host/module_loader.h"
@@ -64,7 +65,7 @@ Json::Value Reason(const char* text) {
 }
 
 RunnerAnswer Error(int code, const Json::Value& errors) {
-  return {false, code, ToJson(ErrorEnvelope(code, errors))};
+  return {false, code, ToJson(kova::ErrorEnvelope(code, errors))};
 }
 
 }  // namespace
@@ -100,7 +101,7 @@ RunnerAnswer ExecuteCall(const RunnerCall& call) {
   }
   switch (response.GetState()) {
     case KOVA::APIResponse::State::kSuccess:
-      return {false, 0, ToJson(SuccessEnvelope(response.GetData()))};
+      return {false, 0, ToJson(kova::SuccessEnvelope(response.GetData()))};
     case KOVA::APIResponse::State::kError:
       return Error(response.GetErrorCode(), response.GetData());
     case KOVA::APIResponse::State::kUnset:

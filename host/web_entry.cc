@@ -4,6 +4,8 @@
 #include <map>
 #include <set>
 
+#include "common/answer_envelope.h"
+#include "common/method_list.h"
 #include "host/cgi_output.h"
 #include "host/host_log.h"
 #include "host/json_text.h"
@@ -198,7 +200,7 @@ EntryReply WebEntry::Info() const {
   }
   Json::Value data;
   data["apis"] = list;
-  return Json(SuccessEnvelope(data));
+  return Json(kova::SuccessEnvelope(data));
 }
 
 std::optional<EntryReply> WebEntry::SignIn(const CallPtr& call_ptr) {
@@ -220,7 +222,7 @@ std::optional<EntryReply> WebEntry::SignIn(const CallPtr& call_ptr) {
     Json::Value errors;
     errors["reason"] = "too many failed sign-ins; try again later";
     errors["retry_after"] = wait;
-    EntryReply reply = Json(ErrorEnvelope(kErrorSignInThrottled, errors));
+    EntryReply reply = Json(kova::ErrorEnvelope(kErrorSignInThrottled, errors));
     reply.headers.emplace_back("Retry-After", std::to_string(wait));
     return reply;
   }
@@ -251,7 +253,7 @@ EntryReply WebEntry::CheckPassword(Call& call, const std::vector<std::string>& k
   data["token"] = session.token;
   data["account"] = *account;
   data["admin"] = admin;
-  EntryReply reply = Json(SuccessEnvelope(data));
+  EntryReply reply = Json(kova::SuccessEnvelope(data));
   reply.headers.emplace_back("Set-Cookie", SessionCookie(sid));
   return reply;
 }
@@ -262,7 +264,7 @@ EntryReply WebEntry::SignOut(Call& call) {
   EntryReply refused;
   if (!FindSession(call, sid, session, refused)) return refused;
   sessions_.Remove(sid);
-  EntryReply reply = Json(SuccessEnvelope(Json::Value()));
+  EntryReply reply = Json(kova::SuccessEnvelope(Json::Value()));
   reply.headers.emplace_back("Set-Cookie", SessionCookie(""));
   return reply;
 }
@@ -300,18 +302,11 @@ bool WebEntry::FindSession(Call& call, std::string& sid, Session& session, Entry
 
 std::optional<EntryReply> WebEntry::RunModule(const CallPtr& call_ptr) {
   Call& call = *call_ptr;
-  const std::shared_ptr<const Json::Value> methods = runners_.Methods();
-  bool api_known = false, version_known = false, method_known = false;
-  for (const Json::Value& row : *methods) {
-    if (row["api"].asString() != call.api) continue;
-    api_known = true;
-    if (row["version"].asInt() != call.version) continue;
-    version_known = true;
-    method_known = method_known || row["method"].asString() == call.method;
-  }
-  if (!api_known) return Error(KOVA::kAPIErrorNoSuchAPI, "no such API");
-  if (!version_known) return Error(KOVA::kAPIErrorBadVersion, "no such version");
-  if (!method_known) return Error(KOVA::kAPIErrorNoSuchMethod, "no such method");
+  const int missing =
+      kova::FindInMethodList(*runners_.Methods(), call.api, call.version, call.method);
+  if (missing == KOVA::kAPIErrorNoSuchAPI) return Error(missing, "no such API");
+  if (missing == KOVA::kAPIErrorBadVersion) return Error(missing, "no such version");
+  if (missing != 0) return Error(missing, "no such method");
 
   std::string sid;
   Session session;

@@ -5,6 +5,8 @@
 #include <string>
 #include <tuple>
 
+#include "common/answer_envelope.h"
+#include "common/method_list.h"
 #include "kova/webapi.h"
 
 namespace KOVA {
@@ -27,6 +29,19 @@ Registry& TheRegistry() {
   return registry;
 }
 
+// Every method of `methods` as {"api", "version", "method"}, in their order.
+Json::Value ListOf(const std::map<MethodKey, Method>& methods) {
+  Json::Value list(Json::arrayValue);
+  for (const auto& [key, unused] : methods) {
+    Json::Value row;
+    row["api"] = std::get<0>(key);
+    row["version"] = std::get<1>(key);
+    row["method"] = std::get<2>(key);
+    list.append(row);
+  }
+  return list;
+}
+
 // The registered method, or the host error that says why there is none.
 int Find(const MethodKey& key, Method& found) {
   Registry& registry = TheRegistry();
@@ -37,35 +52,17 @@ int Find(const MethodKey& key, Method& found) {
     return 0;
   }
   const auto& [api, version, method] = key;
-  bool api_known = false;
-  bool version_known = false;
-  for (const auto& [other, unused] : registry.methods) {
-    api_known = api_known || std::get<0>(other) == api;
-    version_known = version_known || (std::get<0>(other) == api && std::get<1>(other) == version);
-  }
-  if (!api_known) return kAPIErrorNoSuchAPI;
-  return version_known ? kAPIErrorNoSuchMethod : kAPIErrorBadVersion;
-}
-
-Json::Value Failure(int code, const Json::Value& errors) {
-  Json::Value out;
-  out["success"] = false;
-  out["error"]["code"] = code;
-  if (!errors.isNull()) out["error"]["errors"] = errors;
-  return out;
+  return kova::FindInMethodList(ListOf(registry.methods), api, version, method);
 }
 
 Json::Value Answer(const APIResponse& response) {
   if (!response.IsOutputEnabled() || response.GetState() == APIResponse::State::kUnset) {
-    return Failure(kAPIErrorUnknown, Json::Value());
+    return kova::ErrorEnvelope(kAPIErrorUnknown, Json::Value());
   }
   if (response.GetState() == APIResponse::State::kError) {
-    return Failure(response.GetErrorCode(), response.GetData());
+    return kova::ErrorEnvelope(response.GetErrorCode(), response.GetData());
   }
-  Json::Value out;
-  out["success"] = true;
-  if (!response.GetData().isNull()) out["data"] = response.GetData();
-  return out;
+  return kova::SuccessEnvelope(response.GetData());
 }
 
 }  // namespace
@@ -87,16 +84,16 @@ int APIRunner::Exec(Json::Value& out, const char* api, int version, const char* 
   try {
     const int refused = Call(api, version, method, request, response);
     if (refused == kAPIErrorNotPermitted) {
-      out = Failure(refused, Json::Value());
+      out = kova::ErrorEnvelope(refused, Json::Value());
       return 0;
     }
     if (refused != 0) {
-      out = Failure(refused, Json::Value());
+      out = kova::ErrorEnvelope(refused, Json::Value());
       return -1;
     }
     out = Answer(response);
   } catch (...) {
-    out = Failure(kAPIErrorUnknown, Json::Value());
+    out = kova::ErrorEnvelope(kAPIErrorUnknown, Json::Value());
   }
   return 0;
 }
@@ -104,15 +101,7 @@ int APIRunner::Exec(Json::Value& out, const char* api, int version, const char* 
 Json::Value APIRunner::List() {
   Registry& registry = TheRegistry();
   std::lock_guard lock(registry.mutex);
-  Json::Value list(Json::arrayValue);
-  for (const auto& [key, unused] : registry.methods) {
-    Json::Value row;
-    row["api"] = std::get<0>(key);
-    row["version"] = std::get<1>(key);
-    row["method"] = std::get<2>(key);
-    list.append(row);
-  }
-  return list;
+  return ListOf(registry.methods);
 }
 
 int APIRunner::Register(const APITableEntry* table, const APICheckEntry* checks) {

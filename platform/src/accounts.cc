@@ -102,15 +102,7 @@ bool Write(const std::vector<Record>& records) {
 template <typename Change>
 int Update(Change change) {
   RootScope root;
-  const std::string path = RootPath(kAccountsPath);
-  if (!MakeDirectories(path.substr(0, path.rfind('/')), 0755)) return Failed(KOVA_ERR_IO);
-  FileLock lock(path);
-  if (!lock.locked()) return Failed(KOVA_ERR_IO);
-  std::vector<Record> records;
-  if (!Read(records)) return -1;
-  const int result = change(records);
-  if (result != 0) return result;
-  return Write(records) ? 0 : -1;
+  return UpdateFile<std::vector<Record>>(RootPath(kAccountsPath), Read, change, Write);
 }
 
 std::vector<Record>::iterator Find(std::vector<Record>& records, const std::string& name) {

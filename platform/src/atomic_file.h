@@ -8,6 +8,9 @@
 
 #include <string>
 
+#include "kova/error.h"
+#include "src/system_root.h"
+
 namespace kova {
 
 // Holds an exclusive flock(2) on "<path>.lock" (created when missing) for the
@@ -39,6 +42,29 @@ bool ReplaceFile(const std::string& path, const std::string& content, mode_t mod
 // Removes the temporary files that writers of `path` killed before their rename
 // left beside it. Only for a caller that holds the file's lock.
 void RemoveStaleTemporaries(const std::string& path);
+
+// Read-modify-write of the file at `path` under its lock, its folder made when
+// missing: `read` fills a Data, `change` edits it and, when `change` returns 0,
+// `write` stores it. Returns what `change` returned, or -1 with the platform
+// error set (KOVA_ERR_IO for the folder or the lock; `read` and `write` set
+// their own). The caller holds whatever privileges the file needs.
+template <typename Data, typename Read, typename Change, typename Write>
+int UpdateFile(const std::string& path, Read read, Change change, Write write) {
+  if (!MakeDirectories(path.substr(0, path.rfind('/')), 0755)) {
+    KOVA_SET_ERROR(KOVA_ERR_IO);
+    return -1;
+  }
+  FileLock lock(path);
+  if (!lock.locked()) {
+    KOVA_SET_ERROR(KOVA_ERR_IO);
+    return -1;
+  }
+  Data data;
+  if (!read(data)) return -1;
+  const int result = change(data);
+  if (result != 0) return result;
+  return write(static_cast<const Data&>(data)) ? 0 : -1;
+}
 
 }  // namespace kova
 

@@ -75,18 +75,19 @@ bool Save(const std::string& path, const std::vector<Lun>& luns) {
   return true;
 }
 
-// Runs `change` on the registry under its lock and saves the result.
+// Runs `change` on the registry under its lock and saves the result; a
+// non-zero result of `change` is the platform error to fail with.
 template <typename Change>
 int Update(Change change) {
   RootScope root;
   const std::string path = RootPath(kRegistryPath);
-  if (!MakeDirectories(path.substr(0, path.rfind('/')), 0755)) return FAIL(KOVA_ERR_IO);
-  FileLock lock(path);
-  std::vector<Lun> luns;
-  if (!lock.locked()) return FAIL(KOVA_ERR_IO);
-  if (!Load(path, luns)) return -1;
-  if (int error = change(luns)) return FAIL(error);
-  return Save(path, luns) ? 0 : -1;
+  return UpdateFile<std::vector<Lun>>(
+      path, [&path](std::vector<Lun>& luns) { return Load(path, luns); },
+      [&change](std::vector<Lun>& luns) {
+        const int error = change(luns);
+        return error != 0 ? FAIL(error) : 0;
+      },
+      [&path](const std::vector<Lun>& luns) { return Save(path, luns); });
 }
 
 }  // namespace

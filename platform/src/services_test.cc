@@ -297,13 +297,19 @@ while :; do sleep 0.05; done
       {"stop_signal=SIGUSR1\nstop_timeout=1\n", "stay", milliseconds(1000)},
   };
   for (const auto& c : cases) {
-    for (const char* file : {"/signals", "/child_ready"}) unlink(root_.Path(file).c_str());
+    for (const char* file : {"/signals", "/child_ready", "/child"})
+      unlink(root_.Path(file).c_str());
     root_.Write(
         "/etc/kova/services/demo.conf",
         "command=\"/bin/sh " + root_.Path("/opt/family.sh") + " " + c.main + "\"\n" + c.keys);
     ASSERT_EQ(QLIBServiceStart("demo", 0), 0) << c.keys;
     const kova::ProcessIdentity main = Recorded();
-    ASSERT_TRUE(Eventually([&] { return access(root_.Path("/child_ready").c_str(), F_OK) == 0; }));
+    // The child may be ready before the main process has written its pid.
+    ASSERT_TRUE(Eventually([&] {
+      const std::string pid = root_.Read("/child");
+      return access(root_.Path("/child_ready").c_str(), F_OK) == 0 && !pid.empty() &&
+             pid.back() == '\n';
+    }));
     kova::ProcessIdentity child{std::stoi(root_.Read("/child")), 0};
     ASSERT_TRUE(kova::ReadProcessStart(child.pid, child.start_time));
     const auto start = std::chrono::steady_clock::now();

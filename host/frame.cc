@@ -84,21 +84,25 @@ IoResult WriteFrames(int fd, std::string_view first, std::string_view second,
 }
 
 IoResult FrameReader::Fill(size_t size, Clock::time_point deadline) {
-  if (start_ > 0 && buffer_.size() - start_ < size) {
+  if (start_ > 0 && end_ - start_ < size) {
     buffer_.erase(0, start_);
+    end_ -= start_;
     start_ = 0;
   }
-  while (buffer_.size() - start_ < size) {
+  while (end_ - start_ < size) {
     // Without a deadline the read may block; with one, poll says when to read.
     if (deadline != kNoDeadline) {
       if (IoResult waited = Wait(fd_, POLLIN, deadline); waited != IoResult::kOk) return waited;
     }
-    const size_t have = buffer_.size();
-    buffer_.resize(std::max(start_ + size, have + 65536));
-    const ssize_t got = recv(fd_, buffer_.data() + have, buffer_.size() - have,
+    // The buffer only grows here, so each byte of it is cleared once.
+    const size_t room = std::max(start_ + size, end_ + kReadSize);
+    if (buffer_.size() < room) buffer_.resize(room);
+    const ssize_t got = recv(fd_, buffer_.data() + end_, buffer_.size() - end_,
                              deadline == kNoDeadline ? 0 : MSG_DONTWAIT);
-    buffer_.resize(have + (got > 0 ? static_cast<size_t>(got) : 0));
-    if (got > 0) continue;
+    if (got > 0) {
+      end_ += static_cast<size_t>(got);
+      continue;
+    }
     if (got == 0 || errno == ECONNRESET) return IoResult::kClosed;
     if (errno != EAGAIN && errno != EINTR) return IoResult::kError;
   }
@@ -114,9 +118,10 @@ IoResult FrameReader::Read(std::string& payload, size_t max_size, Clock::time_po
   if (IoResult got = Fill(4 + size, deadline); got != IoResult::kOk) return got;
   payload.assign(buffer_, start_ + 4, size);
   start_ += 4 + size;
-  if (start_ == buffer_.size()) {
-    buffer_.clear();
-    start_ = 0;
+  if (start_ == end_) {
+    start_ = end_ = 0;
+    // A large frame's room is given back; a small one is kept for the next.
+    if (buffer_.size() > kKeptSize) std::string().swap(buffer_);
   }
   return IoResult::kOk;
 }

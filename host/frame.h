@@ -38,15 +38,19 @@ class FrameReader {
   IoResult Read(std::string& payload, size_t max_size, Clock::time_point deadline);
   // Whether bytes already taken from the descriptor wait to be read: poll(2)
   // on the descriptor no longer reports them.
-  bool Buffered() const { return buffer_.size() > start_; }
+  bool Buffered() const { return end_ > start_; }
 
  private:
   // Reads until `size` unread bytes are buffered.
   IoResult Fill(size_t size, Clock::time_point deadline);
 
+  static constexpr size_t kReadSize = 65536;            // asked of each read at least
+  static constexpr size_t kKeptSize = size_t{1} << 20;  // room kept between frames
+
   int fd_;
-  std::string buffer_;
-  size_t start_ = 0;  // the first unread byte of buffer_
+  std::string buffer_;  // bytes read are [start_, end_); the rest is room
+  size_t start_ = 0;
+  size_t end_ = 0;
 };
 
 }  // namespace kova_host

@@ -6,10 +6,12 @@
 
 #include <cstdio>
 #include <cstring>
+#include <unordered_map>
 
 #include "kova/conf.h"
 #include "kova/error.h"
 #include "src/atomic_file.h"
+#include "src/file_cache.h"
 #include "src/privilege.h"
 #include "src/system_root.h"
 
@@ -51,6 +53,25 @@ void ForEachLine(std::string_view content, Visit visit) {
   }
 }
 
+// The keys of a file and their values, the first line of a key counting.
+using ConfKeys = std::unordered_map<std::string, std::string>;
+
+bool ParseConf(const std::string& path, ConfKeys& keys) {
+  std::string content;
+  if (!ReadWholeFile(path, content)) return false;
+  ForEachLine(content, [&](std::string_view line) {
+    std::string_view key, value;
+    if (ParseLine(line, key, value)) keys.emplace(key, value);
+  });
+  return true;
+}
+
+// Service descriptions and package INFO files are read once per look-up burst.
+FileCache<ConfKeys>& ConfCache() {
+  static FileCache<ConfKeys> cache(512);
+  return cache;
+}
+
 }  // namespace
 
 bool IsConfKey(std::string_view key) {
@@ -68,21 +89,16 @@ int ConfRead(const std::string& path, std::string_view key, std::string& value) 
     KOVA_SET_ERROR(KOVA_ERR_INVALID);
     return -1;
   }
-  std::string content;
-  if (!ReadWholeFile(path, content)) {
+  const std::shared_ptr<const ConfKeys> keys = ConfCache().Get(path, ParseConf);
+  if (keys == nullptr) {
     if (errno == ENOENT) return 0;
     KOVA_SET_ERROR(errno == EACCES ? KOVA_ERR_PERMISSION : KOVA_ERR_IO);
     return -1;
   }
-  int found = 0;
-  ForEachLine(content, [&](std::string_view line) {
-    std::string_view line_key, line_value;
-    if (found == 0 && ParseLine(line, line_key, line_value) && line_key == key) {
-      value.assign(line_value);
-      found = 1;
-    }
-  });
-  return found;
+  const auto it = keys->find(std::string(key));
+  if (it == keys->end()) return 0;
+  value = it->second;
+  return 1;
 }
 
 int ConfWrite(const std::string& path, std::string_view key, std::string_view value) {

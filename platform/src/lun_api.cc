@@ -1,7 +1,5 @@
 #include "src/lun_api.h"
 
-#include <vector>
-
 #include "kova/webapi.h"
 #include "src/lun_registry.h"
 
@@ -13,14 +11,13 @@ void lun_get_v1(KOVA::APIRequest* request, KOVA::APIResponse* response) {
   if (!uuid.isString() || uuid.asString().empty()) {
     return response->SetError(KOVA::kAPIErrorBadParameter, Json::Value());
   }
-  std::vector<Lun> luns;
-  if (ReadLuns(luns) != 0) return response->SetError(KOVA::kAPIErrorUnknown, Json::Value());
-  for (const Lun& lun : luns) {
-    if (lun.uuid == uuid.asString()) {
-      Json::Value data;
-      data["lun"] = LunToJson(lun);
-      return response->SetSuccess(data);
-    }
+  Lun lun;
+  const int found = FindLun(uuid.asString(), lun);
+  if (found < 0) return response->SetError(KOVA::kAPIErrorUnknown, Json::Value());
+  if (found > 0) {
+    Json::Value data;
+    data["lun"] = LunToJson(lun);
+    return response->SetSuccess(data);
   }
   response->SetError(kLunErrorNotFound, Json::Value());
 }

@@ -6,9 +6,11 @@
 
 #include <algorithm>
 #include <memory>
+#include <unordered_map>
 
 #include "kova/error.h"
 #include "src/atomic_file.h"
+#include "src/file_cache.h"
 #include "src/privilege.h"
 #include "src/system_root.h"
 
@@ -62,6 +64,25 @@ bool Load(const std::string& path, std::vector<Lun>& luns) {
   return true;
 }
 
+// The registry as read, with the position of each uuid (its first entry).
+struct LunTable {
+  std::vector<Lun> luns;
+  std::unordered_map<std::string, size_t> by_uuid;
+};
+
+bool LoadTable(const std::string& path, LunTable& table) {
+  if (!Load(path, table.luns)) return false;
+  for (size_t i = 0; i < table.luns.size(); ++i) table.by_uuid.emplace(table.luns[i].uuid, i);
+  return true;
+}
+
+// The registry of the current system root; nullptr with the platform error set.
+std::shared_ptr<const LunTable> CachedTable() {
+  static FileCache<LunTable> cache(16);
+  RootScope root;
+  return cache.Get(RootPath(kRegistryPath), LoadTable);
+}
+
 bool Save(const std::string& path, const std::vector<Lun>& luns) {
   Json::Value root;
   root["luns"] = Json::Value(Json::arrayValue);
@@ -93,8 +114,19 @@ int Update(Change change) {
 }  // namespace
 
 int ReadLuns(std::vector<Lun>& luns) {
-  RootScope root;
-  return Load(RootPath(kRegistryPath), luns) ? 0 : -1;
+  const std::shared_ptr<const LunTable> table = CachedTable();
+  if (table == nullptr) return -1;
+  luns = table->luns;
+  return 0;
+}
+
+int FindLun(const std::string& uuid, Lun& lun) {
+  const std::shared_ptr<const LunTable> table = CachedTable();
+  if (table == nullptr) return -1;
+  const auto it = table->by_uuid.find(uuid);
+  if (it == table->by_uuid.end()) return 0;
+  lun = table->luns[it->second];
+  return 1;
 }
 
 int AddLun(const Lun& lun) {

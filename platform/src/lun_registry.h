@@ -24,6 +24,10 @@ struct Lun {
 // read or is not in the expected form.
 int ReadLuns(std::vector<Lun>& luns);
 
+// Looks up the LUN `uuid`. Returns 1 with `lun` filled, 0 when there is no
+// such LUN, or -1 with the last platform error set as ReadLuns does.
+int FindLun(const std::string& uuid, Lun& lun);
+
 // Adds `lun`. Returns 0, or -1 with the last platform error set: an invalid
 // field (KOVA_ERR_INVALID), a uuid that is registered already
 // (KOVA_ERR_INVALID), or a registry that can't be written.

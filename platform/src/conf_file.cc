@@ -53,9 +53,7 @@ void ForEachLine(std::string_view content, Visit visit) {
   }
 }
 
-// The keys of a file and their values, the first line of a key counting.
-using ConfKeys = std::unordered_map<std::string, std::string>;
-
+// The first line of a key counts.
 bool ParseConf(const std::string& path, ConfKeys& keys) {
   std::string content;
   if (!ReadWholeFile(path, content)) return false;
@@ -84,12 +82,16 @@ bool IsConfKey(std::string_view key) {
   return true;
 }
 
+std::shared_ptr<const ConfKeys> ConfReadAll(const std::string& path) {
+  return ConfCache().Get(path, ParseConf);
+}
+
 int ConfRead(const std::string& path, std::string_view key, std::string& value) {
   if (!IsConfKey(key)) {
     KOVA_SET_ERROR(KOVA_ERR_INVALID);
     return -1;
   }
-  const std::shared_ptr<const ConfKeys> keys = ConfCache().Get(path, ParseConf);
+  const std::shared_ptr<const ConfKeys> keys = ConfReadAll(path);
   if (keys == nullptr) {
     if (errno == ENOENT) return 0;
     KOVA_SET_ERROR(errno == EACCES ? KOVA_ERR_PERMISSION : KOVA_ERR_IO);

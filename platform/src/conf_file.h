@@ -9,8 +9,10 @@
 #ifndef KOVA_PLATFORM_SRC_CONF_FILE_H_
 #define KOVA_PLATFORM_SRC_CONF_FILE_H_
 
+#include <memory>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 
 namespace kova {
 
@@ -21,6 +23,12 @@ bool IsConfKey(std::string_view key);
 // found, 0 when the file has no such key or doesn't exist, -1 when it can't be
 // read (the last platform error says why).
 int ConfRead(const std::string& path, std::string_view key, std::string& value);
+
+// Every key of the file at the real path `path` with its value, as ConfRead
+// reads them: nullptr with errno set when the file can't be read (ENOENT when
+// it doesn't exist).
+using ConfKeys = std::unordered_map<std::string, std::string>;
+std::shared_ptr<const ConfKeys> ConfReadAll(const std::string& path);
 
 // Sets `key` to `value` in the file at the real path `path`, creating the file
 // (mode 0644) and its directories when missing. The write holds the file's lock

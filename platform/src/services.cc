@@ -288,13 +288,21 @@ int DescribeService(const std::string& name, ServiceDescription& description) {
     KOVA_SET_ERROR(KOVA_ERR_SERVICE_UNKNOWN);
     return 0;
   }
+  // One read of the description for all its keys.
+  const std::shared_ptr<const ConfKeys> keys = ConfReadAll(path);
+  if (keys == nullptr && errno != ENOENT) {
+    KOVA_SET_ERROR(errno == EACCES ? KOVA_ERR_PERMISSION : KOVA_ERR_IO);
+    return -1;
+  }
   for (auto [key, field] :
        {std::pair{"command", &description.command},
         std::pair{"display_name", &description.display_name},
         std::pair{"package", &description.package}, std::pair{"user", &description.user},
         std::pair{"stop_signal", &description.stop_signal},
         std::pair{"stop_timeout", &description.stop_timeout}}) {
-    if (ConfRead(path, key, *field) < 0) return -1;
+    if (keys == nullptr) break;
+    const auto it = keys->find(key);
+    if (it != keys->end()) *field = it->second;
   }
   if (description.display_name.empty()) description.display_name = name;
   return 1;

@@ -26,7 +26,8 @@ bool SameTime(const timespec& a, const timespec& b) {
 
 bool CacheStamp::operator==(const CacheStamp& other) const {
   return device == other.device && inode == other.inode && size == other.size &&
-         SameTime(modified, other.modified) && SameTime(changed, other.changed);
+         mode == other.mode && SameTime(modified, other.modified) &&
+         SameTime(changed, other.changed);
 }
 
 bool StampFile(const std::string& path, CacheStamp& stamp) {
@@ -35,6 +36,7 @@ bool StampFile(const std::string& path, CacheStamp& stamp) {
   stamp.device = info.st_dev;
   stamp.inode = info.st_ino;
   stamp.size = info.st_size;
+  stamp.mode = info.st_mode;
   stamp.modified = info.st_mtim;
   stamp.changed = info.st_ctim;
   return true;

@@ -21,6 +21,7 @@ struct CacheStamp {
   dev_t device = 0;
   ino_t inode = 0;
   off_t size = 0;
+  mode_t mode = 0;
   timespec modified{};
   timespec changed{};
 
@@ -38,8 +39,8 @@ bool IsSettled(const CacheStamp& stamp);
 bool FileCacheEnabled();
 void SetFileCacheEnabled(bool enabled);
 
-// Up to `capacity` parsed files of type T, by path and the caller's effective
-// ids (a file read with raised privileges isn't answered to a caller without).
+// Up to `capacity` parsed files of type T, by path (and the caller's effective
+// ids for a file that not everyone may read).
 template <typename T>
 class FileCache {
  public:
@@ -51,10 +52,18 @@ class FileCache {
   template <typename Parse>
   std::shared_ptr<const T> Get(const std::string& path, Parse parse) {
     CacheStamp before;
-    const bool cacheable = FileCacheEnabled() && StampFile(path, before);
-    const std::string key =
-        path + '\0' + std::to_string(geteuid()) + ':' + std::to_string(getegid());
-    if (cacheable) {
+    if (!FileCacheEnabled() || !StampFile(path, before)) {
+      auto value = std::make_shared<T>();
+      return parse(path, *value) ? value : nullptr;
+    }
+    // A file anyone may read is kept once for every caller; another one per
+    // effective ids, so that content read with raised privileges isn't
+    // answered to a caller without them.
+    std::string key = path;
+    if ((before.mode & S_IROTH) == 0) {
+      key += '\0' + std::to_string(geteuid()) + ':' + std::to_string(getegid());
+    }
+    {
       std::lock_guard<std::mutex> lock(mutex_);
       const auto it = entries_.find(key);
       if (it != entries_.end() && it->second.stamp == before) return it->second.value;
@@ -64,7 +73,7 @@ class FileCache {
     // Kept only when no write came between the two looks and none can hide
     // behind the same timestamp later.
     CacheStamp after;
-    const bool keep = cacheable && StampFile(path, after) && after == before && IsSettled(after);
+    const bool keep = StampFile(path, after) && after == before && IsSettled(after);
     std::lock_guard<std::mutex> lock(mutex_);
     if (!keep) {
       entries_.erase(key);

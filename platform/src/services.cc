@@ -278,7 +278,11 @@ int DescribeService(const std::string& name, ServiceDescription& description) {
   }
   description = ServiceDescription{name, "", name, "", "", "", ""};
   const std::string path = DescriptionPath(name);
-  if (access(path.c_str(), F_OK) != 0) {
+  // One read of the description for all its keys; its existence is looked at
+  // only when it can't be read.
+  const std::shared_ptr<const ConfKeys> keys = ConfReadAll(path);
+  const int read_error = errno;
+  if (keys == nullptr && access(path.c_str(), F_OK) != 0) {
     const std::string package = name.substr(std::min(name.size(), sizeof(kPackagePrefix) - 1));
     if (name.rfind(kPackagePrefix, 0) == 0 && !package.empty() &&
         IsDirectory(RootPath(kPackagesDir + package))) {
@@ -288,10 +292,8 @@ int DescribeService(const std::string& name, ServiceDescription& description) {
     KOVA_SET_ERROR(KOVA_ERR_SERVICE_UNKNOWN);
     return 0;
   }
-  // One read of the description for all its keys.
-  const std::shared_ptr<const ConfKeys> keys = ConfReadAll(path);
-  if (keys == nullptr && errno != ENOENT) {
-    KOVA_SET_ERROR(errno == EACCES ? KOVA_ERR_PERMISSION : KOVA_ERR_IO);
+  if (keys == nullptr && read_error != ENOENT) {
+    KOVA_SET_ERROR(read_error == EACCES ? KOVA_ERR_PERMISSION : KOVA_ERR_IO);
     return -1;
   }
   for (auto [key, field] :

@@ -12,11 +12,13 @@ int HexDigit(char c) {
   return -1;
 }
 
-bool Unescape(std::string_view text, std::string& out) {
+}  // namespace
+
+bool PercentDecode(std::string_view text, bool plus_is_blank, std::string& out) {
   out.clear();
   out.reserve(text.size());
   for (size_t i = 0; i < text.size(); ++i) {
-    if (text[i] == '+') {
+    if (plus_is_blank && text[i] == '+') {
       out += ' ';
     } else if (text[i] != '%') {
       out += text[i];
@@ -31,8 +33,6 @@ bool Unescape(std::string_view text, std::string& out) {
   return true;
 }
 
-}  // namespace
-
 bool DecodeForm(std::string_view text, FormFields& fields, std::string& error) {
   while (!text.empty()) {
     const size_t end = text.find('&');
@@ -41,8 +41,9 @@ bool DecodeForm(std::string_view text, FormFields& fields, std::string& error) {
     if (field.empty()) continue;
     const size_t equals = field.find('=');
     std::string name, value;
-    if (!Unescape(field.substr(0, equals), name) ||
-        (equals != std::string_view::npos && !Unescape(field.substr(equals + 1), value))) {
+    if (!PercentDecode(field.substr(0, equals), true, name) ||
+        (equals != std::string_view::npos &&
+         !PercentDecode(field.substr(equals + 1), true, value))) {
       error = "broken percent-encoding in the parameters";
       return false;
     }

@@ -20,6 +20,10 @@ using FormFields = std::vector<std::pair<std::string, std::string>>;
 // on a broken percent-encoding or an empty name.
 bool DecodeForm(std::string_view text, FormFields& fields, std::string& error);
 
+// Decodes "%XX" escapes of `text` into `out`, and "+" as a blank when
+// `plus_is_blank` (form fields, not paths). False on a broken escape.
+bool PercentDecode(std::string_view text, bool plus_is_blank, std::string& out);
+
 // The value of a parameter: its JSON value when the whole text is valid JSON
 // ("10", "true", "[\"a\"]", "{\"k\": 1}"), the text itself otherwise ("csv").
 // False for JSON nested deeper than kMaxParamDepth, which no call may carry.

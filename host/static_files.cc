@@ -10,6 +10,8 @@
 #include <climits>
 #include <cstdlib>
 
+#include "host/params.h"
+
 namespace kova_host {
 namespace {
 
@@ -44,29 +46,12 @@ const char* MediaType(std::string_view path) {
   return "application/octet-stream";
 }
 
-int Hex(char c) {
-  if (c >= '0' && c <= '9') return c - '0';
-  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-  return -1;
-}
-
 // The path decoded and relative to the folder, or false when it is malformed,
 // holds a NUL or steps up with "..".
 bool RelativePath(std::string_view raw, std::string& relative) {
   if (raw.empty() || raw[0] != '/') return false;
   std::string path;
-  for (size_t i = 0; i < raw.size(); ++i) {
-    if (raw[i] != '%') {
-      path += raw[i];
-      continue;
-    }
-    const int high = i + 2 < raw.size() ? Hex(raw[i + 1]) : -1;
-    const int low = high < 0 ? -1 : Hex(raw[i + 2]);
-    if (low < 0 || (high == 0 && low == 0)) return false;
-    path += static_cast<char>(high * 16 + low);
-    i += 2;
-  }
+  if (!PercentDecode(raw, false, path) || path.find('\0') != std::string::npos) return false;
   for (size_t start = 0; start <= path.size();) {
     size_t end = path.find('/', start);
     if (end == std::string::npos) end = path.size();

@@ -4,36 +4,35 @@
 
 #include <errno.h>
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
-#include <memory>
 #include <string_view>
 
 #include "kova/conf.h"
 #include "kova/error.h"
 #include "kova/log.h"
 #include "src/conf_file.h"
+#include "src/log_folder.h"
+#include "src/log_migration.h"
 #include "src/privilege.h"
-#include "src/sqlite_db.h"
 #include "src/system_root.h"
 
 namespace kova {
 namespace {
 
-constexpr char kSchema[] =
-    "CREATE TABLE IF NOT EXISTS records("
-    "id INTEGER PRIMARY KEY AUTOINCREMENT, level TEXT NOT NULL, time INTEGER NOT NULL, "
-    "user TEXT NOT NULL, source TEXT NOT NULL, event TEXT NOT NULL)";
-
-// The database of each log type, under the system root.
+// The store of each log type, under the system root, and where earlier
+// versions kept it.
 const char* StoreName(int type) { return type == kLogTypePerfEvent ? "perfevent" : nullptr; }
 
-std::string StorePath(int type) {
-  return RootPath(std::string("/var/log/kova/") + StoreName(type) + ".db");
+std::string FolderPath(int type) {
+  return RootPath(std::string("/var/log/kova/") + StoreName(type));
 }
+
+std::string OldDatabasePath(int type) { return FolderPath(type) + ".db"; }
 
 int64_t MaxRecords() {
   std::string text;
@@ -47,56 +46,46 @@ bool IsLevel(const std::string& level) {
   return level == kLogLevelInfo || level == kLogLevelWarning || level == kLogLevelCritical;
 }
 
-// `text` with the characters that would break a fetched line made blanks.
-std::string OneLine(std::string text, bool keep_tabs) {
-  for (char& c : text) {
+// Appends `text` with the characters that would break a fetched line made blanks.
+void PutOneLine(std::string_view text, bool keep_tabs, std::string& out) {
+  const size_t at = out.size();
+  out.append(text);
+  for (size_t i = at; i < out.size(); ++i) {
+    char& c = out[i];
     if (c == '\n' || c == '\r' || (c == '\t' && !keep_tabs)) c = ' ';
   }
-  return text;
 }
 
-// Appends to a file through a large buffer.
-class Output {
- public:
-  explicit Output(int fd) : fd_(fd) {}
-  void Put(std::string_view text) {
-    if (used_ + text.size() > sizeof(buffer_)) Flush();
-    if (text.size() > sizeof(buffer_)) {
-      Write(text.data(), text.size());
-      return;
-    }
-    memcpy(buffer_ + used_, text.data(), text.size());
-    used_ += text.size();
-  }
-  void Put(char c) {
-    if (used_ == sizeof(buffer_)) Flush();
-    buffer_[used_++] = c;
-  }
-  void Flush() {
-    Write(buffer_, used_);
-    used_ = 0;
-  }
-  bool ok() const { return ok_; }
+// Moves a log that an earlier version kept in a database into its folder, or
+// removes the database that a move ended by a crash left beside the folder.
+// True when there is no database, or it was moved.
+bool MoveOldStore(int type) {
+  const std::string database = OldDatabasePath(type);
+  struct stat info;
+  if (lstat(database.c_str(), &info) != 0) return errno == ENOENT;
+  return MigrateSqliteLog(database, FolderPath(type), SegmentLines(MaxRecords()));
+}
 
- private:
-  void Write(const char* data, size_t size) {
-    while (ok_ && size > 0) {
-      const ssize_t wrote = write(fd_, data, size);
-      if (wrote < 0 && errno == EINTR) continue;
-      if (wrote <= 0) {
-        ok_ = false;
-        break;
-      }
-      data += wrote;
-      size -= static_cast<size_t>(wrote);
+// Opens the store of log `type`, moving it over from an earlier version's
+// database first and, with `create`, making it when there is none. False with
+// `missing` set when there is none and it wasn't to be made; false with the
+// platform error set when it can't be opened.
+bool OpenStore(int type, LogFolder::Access access, bool create, LogFolder& folder, bool& missing) {
+  missing = false;
+  const std::string path = FolderPath(type);
+  if (MoveOldStore(type)) {
+    if (folder.Open(path, access)) return true;
+    if (errno == ENOENT && !create) {
+      missing = true;
+      return false;
+    }
+    if (errno == ENOENT && LogFolder::Create(path, 1, nullptr) && folder.Open(path, access)) {
+      return true;
     }
   }
-
-  int fd_;
-  bool ok_ = true;
-  size_t used_ = 0;
-  char buffer_[1 << 20];
-};
+  KOVA_SET_ERROR(errno == EACCES ? KOVA_ERR_PERMISSION : KOVA_ERR_STORE);
+  return false;
+}
 
 }  // namespace
 
@@ -127,6 +116,24 @@ size_t LogTimeFormatter::Format(int64_t seconds, char out[32]) {
   return length;
 }
 
+void PutLogLine(int64_t id, std::string_view level, std::string_view time, std::string_view user,
+                std::string_view source, std::string_view event, std::string& out) {
+  char id_text[24];
+  out.append(id_text, static_cast<size_t>(
+                          snprintf(id_text, sizeof(id_text), "%lld", static_cast<long long>(id))));
+  out += '\t';
+  out.append(level);
+  out += '\t';
+  out.append(time);
+  out += '\t';
+  PutOneLine(user, false, out);
+  out += '\t';
+  PutOneLine(source, false, out);
+  out += '\t';
+  PutOneLine(event, true, out);
+  out += '\n';
+}
+
 int AppendLogRecords(int type, const std::vector<LogRecord>& records) {
   if (StoreName(type) == nullptr) {
     KOVA_SET_ERROR(KOVA_ERR_NOT_FOUND);
@@ -138,32 +145,23 @@ int AppendLogRecords(int type, const std::vector<LogRecord>& records) {
       return -1;
     }
   }
+  if (records.empty()) return 0;
   const int64_t max_records = MaxRecords();
   RootScope root;
-  Database db;
-  if (!db.Open(StorePath(type), true, kSchema) || !db.Exec("BEGIN IMMEDIATE")) {
-    KOVA_SET_ERROR(KOVA_ERR_STORE);
-    return -1;
-  }
-  Statement insert(db,
-                   "INSERT INTO records(level, time, user, source, event) VALUES(?, ?, ?, ?, ?)");
-  bool ok = insert.ok();
+  LogFolder folder;
+  bool missing;
+  if (!OpenStore(type, LogFolder::Access::kWrite, true, folder, missing)) return -1;
+  std::string text;
+  LogTimeFormatter times;
+  char time_text[32];
+  int64_t id = folder.next_id();
   for (const LogRecord& record : records) {
-    if (!ok) break;
-    insert.Bind(1, record.level)
-        .Bind(2, record.time)
-        .Bind(3, OneLine(record.user, false))
-        .Bind(4, OneLine(record.source, false))
-        .Bind(5, OneLine(record.event, true));
-    ok = insert.Step() == SQLITE_DONE;
-    insert.Reset();
+    PutLogLine(id++, record.level,
+               std::string_view(time_text, times.Format(record.time, time_text)), record.user,
+               record.source, record.event, text);
   }
-  // Ids grow by one per record and only the oldest are ever removed, so the
-  // records to keep are the last `max_records` ids.
-  Statement trim(db, "DELETE FROM records WHERE id <= (SELECT max(id) FROM records) - ?");
-  ok = ok && trim.Bind(1, max_records).Step() == SQLITE_DONE && db.Exec("COMMIT");
-  if (!ok) {
-    db.Exec("ROLLBACK");
+  if (!folder.Append(text, static_cast<int64_t>(records.size()), SegmentLines(max_records)) ||
+      !folder.Trim(max_records)) {
     KOVA_SET_ERROR(KOVA_ERR_STORE);
     return -1;
   }
@@ -176,37 +174,13 @@ int DumpLogRecords(int type, int fd) {
     return -1;
   }
   RootScope root;
-  Database db;
-  bool missing = false;
-  if (!db.Open(StorePath(type), false, nullptr, &missing)) {
-    if (missing) return 0;  // a log never written has no records
-    KOVA_SET_ERROR(KOVA_ERR_STORE);
-    return -1;
+  LogFolder folder;
+  bool missing;
+  if (!OpenStore(type, LogFolder::Access::kRead, false, folder, missing)) {
+    return missing ? 0 : -1;  // a log never written has no records
   }
-  Statement select(db, "SELECT id, level, time, user, source, event FROM records ORDER BY id");
-  auto output = std::make_unique<Output>(fd);
-  LogTimeFormatter times;
-  char id[24];
-  char time_text[32];
-  int step;
-  while ((step = select.Step()) == SQLITE_ROW) {
-    const int id_length = snprintf(id, sizeof(id), "%lld", static_cast<long long>(select.Int(0)));
-    output->Put(std::string_view(id, id_length));
-    output->Put('\t');
-    output->Put(select.Text(1));
-    output->Put('\t');
-    output->Put(std::string_view(time_text, times.Format(select.Int(2), time_text)));
-    output->Put('\t');
-    output->Put(select.Text(3));
-    output->Put('\t');
-    output->Put(select.Text(4));
-    output->Put('\t');
-    output->Put(select.Text(5));
-    output->Put('\n');
-  }
-  output->Flush();
-  if (step != SQLITE_DONE || !output->ok()) {
-    KOVA_SET_ERROR(step != SQLITE_DONE ? KOVA_ERR_STORE : KOVA_ERR_IO);
+  if (!folder.CopyTo(fd)) {
+    KOVA_SET_ERROR(KOVA_ERR_IO);
     return -1;
   }
   return 0;
@@ -219,7 +193,9 @@ int KOVALogFilePathGet(int type, char* path, size_t size) {
     KOVA_SET_ERROR(KOVA_ERR_NOT_FOUND);
     return -1;
   }
-  const std::string store = kova::StorePath(type);
+  kova::RootScope root;
+  kova::MoveOldStore(type);
+  const std::string store = kova::FolderPath(type);
   if (store.size() >= size) {
     KOVA_SET_ERROR(KOVA_ERR_INVALID);
     return -1;
@@ -254,14 +230,12 @@ int KOVALogClean(int type) {
     return -1;
   }
   kova::RootScope root;
-  kova::Database db;
-  bool missing = false;
-  if (!db.Open(kova::StorePath(type), false, nullptr, &missing)) {
-    if (missing) return 0;
-    KOVA_SET_ERROR(KOVA_ERR_STORE);
-    return -1;
+  kova::LogFolder folder;
+  bool missing;
+  if (!kova::OpenStore(type, kova::LogFolder::Access::kWrite, false, folder, missing)) {
+    return missing ? 0 : -1;
   }
-  if (!db.Exec("DELETE FROM records")) {
+  if (!folder.Clear()) {
     KOVA_SET_ERROR(KOVA_ERR_STORE);
     return -1;
   }

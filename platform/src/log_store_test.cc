@@ -1,12 +1,15 @@
 #include "src/log_store.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sqlite3.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstdlib>
 #include <sstream>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "kova/conf.h"
@@ -27,6 +30,12 @@ std::vector<std::string> Dump(const TestRoot& root) {
   std::vector<std::string> lines;
   for (std::string line; std::getline(text, line);) lines.push_back(line);
   return lines;
+}
+
+std::vector<std::string> Ids(const std::vector<std::string>& lines) {
+  std::vector<std::string> ids;
+  for (const std::string& line : lines) ids.push_back(line.substr(0, line.find('\t')));
+  return ids;
 }
 
 bool StoreExists() {
@@ -54,7 +63,7 @@ TEST(LogStoreTest, ALogNeverWrittenHasNoFile) {
   TestRoot root;
   char path[4096];
   ASSERT_EQ(KOVALogFilePathGet(kLogTypePerfEvent, path, sizeof(path)), 0);
-  EXPECT_EQ(std::string(path), root.Path("/var/log/kova/perfevent.db"));
+  EXPECT_EQ(std::string(path), root.Path("/var/log/kova/perfevent"));
   EXPECT_EQ(KOVALogFilePathGet(kLogTypePerfEvent, path, 8), -1);
   EXPECT_EQ(KOVALogFilePathGet(3, path, sizeof(path)), -1);
   EXPECT_EQ(Dump(root), std::vector<std::string>());
@@ -85,9 +94,7 @@ TEST(LogStoreTest, KeepsTheNewestRecordsAndNeverReusesIds) {
     ASSERT_EQ(KOVALogWrite(kLogTypePerfEvent, "Info", "admin", "test", std::to_string(i).c_str()),
               0);
   }
-  std::vector<std::string> ids;
-  for (const std::string& line : Dump(root)) ids.push_back(line.substr(0, line.find('\t')));
-  EXPECT_EQ(ids, (std::vector<std::string>{"3", "4", "5"}));
+  EXPECT_EQ(Ids(Dump(root)), (std::vector<std::string>{"3", "4", "5"}));
 
   ASSERT_EQ(KOVALogClean(kLogTypePerfEvent), 0);
   EXPECT_TRUE(StoreExists());
@@ -96,6 +103,118 @@ TEST(LogStoreTest, KeepsTheNewestRecordsAndNeverReusesIds) {
   const std::vector<std::string> after = Dump(root);
   ASSERT_EQ(after.size(), 1u);
   EXPECT_EQ(after[0].substr(0, 2), "6\t");
+}
+
+// The oldest records go a segment (an eighth of the bound) at a time: the log
+// holds the newest `max` records at least and one segment more at most.
+TEST(LogStoreTest, DropsTheOldestWholeSegments) {
+  TestRoot root;
+  ASSERT_EQ(QLIBCINFOSetKeyValue(kova::kLogMaxRecordsKey, "16"), 0);
+  for (int i = 1; i <= 41; ++i) {
+    ASSERT_EQ(KOVALogWrite(kLogTypePerfEvent, "Info", "admin", "test", "e"), 0);
+    const std::vector<std::string> ids = Ids(Dump(root));
+    ASSERT_GE(ids.size(), std::min(i, 16));
+    ASSERT_LE(ids.size(), 18u);
+    ASSERT_EQ(ids.back(), std::to_string(i));
+    ASSERT_EQ(ids.front(), std::to_string(i - static_cast<int>(ids.size()) + 1));
+  }
+}
+
+// A crash in the middle of a write leaves a line without its line feed: it is
+// never read, and the next write takes its place and its id.
+TEST(LogStoreTest, ATornLastLineIsNeverRead) {
+  TestRoot root;
+  for (const char* event : {"one", "two"}) {
+    ASSERT_EQ(KOVALogWrite(kLogTypePerfEvent, "Info", "admin", "test", event), 0);
+  }
+  const std::string segment = "/var/log/kova/perfevent/00000000000000000001.log";
+  const std::string whole = root.Read(segment);
+  root.Write(segment, whole + "3\tWarning\t2024/01/01 00:0", 0600);
+  EXPECT_EQ(Ids(Dump(root)), (std::vector<std::string>{"1", "2"}));
+  ASSERT_EQ(KOVALogWrite(kLogTypePerfEvent, "Critical", "admin", "test", "three"), 0);
+  const std::vector<std::string> lines = Dump(root);
+  ASSERT_EQ(lines.size(), 3u);
+  EXPECT_EQ(lines[2].substr(0, 11), "3\tCritical\t");
+  EXPECT_EQ(root.Read(segment).substr(0, whole.size()), whole);
+}
+
+// A log kept by an earlier version in a database is moved into the folder the
+// first time it is opened, ids, texts and the next id included.
+TEST(LogStoreTest, MovesALogFromTheOldDatabase) {
+  const int64_t t = 1700000000;
+  const struct {
+    const char* name;
+    bool made_already;  // a move that ended before the database was removed
+  } cases[] = {{"first open", false}, {"store made already", true}};
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    TestRoot root;
+    ASSERT_EQ(QLIBCINFOSetKeyValue(kova::kLogMaxRecordsKey, "16"), 0);  // segments of 2
+    const std::string database = root.Path("/var/log/kova/perfevent.db");
+    root.Write("/var/log/kova/keep", "");
+    sqlite3* db = nullptr;
+    ASSERT_EQ(sqlite3_open(database.c_str(), &db), SQLITE_OK);
+    const std::string sql =
+        "CREATE TABLE records(id INTEGER PRIMARY KEY AUTOINCREMENT, level TEXT NOT NULL, "
+        "time INTEGER NOT NULL, user TEXT NOT NULL, source TEXT NOT NULL, event TEXT NOT NULL);"
+        "INSERT INTO records VALUES(5, 'Warning', " +
+        std::to_string(t) +
+        ", 'admin', 'd', 'a, b');"
+        "INSERT INTO records VALUES(6, 'Critical', " +
+        std::to_string(t + 70) +
+        ", 'admin', 'd', '');"
+        "INSERT INTO records VALUES(7, 'Info', " +
+        std::to_string(t + 80) +
+        ", 'admin', 'd', 'x\ty');"
+        "INSERT INTO records VALUES(9, 'Info', " +
+        std::to_string(t + 90) +
+        ", 'admin', 'd', 'z');"
+        "UPDATE sqlite_sequence SET seq = 12 WHERE name = 'records';";
+    ASSERT_EQ(sqlite3_exec(db, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK);
+    sqlite3_close(db);
+    if (c.made_already) {
+      char moved[4096];
+      ASSERT_EQ(KOVALogFilePathGet(kLogTypePerfEvent, moved, sizeof(moved)), 0);
+      root.Write("/var/log/kova/perfevent.db", "left behind");
+    }
+    char path[4096];
+    ASSERT_EQ(KOVALogFilePathGet(kLogTypePerfEvent, path, sizeof(path)), 0);
+    EXPECT_EQ(access(path, F_OK), 0);
+    EXPECT_EQ(access(database.c_str(), F_OK), -1);
+    EXPECT_EQ(Dump(root), (std::vector<std::string>{
+                              "5\tWarning\t" + KOVALogConvertTime1(t) + "\tadmin\td\ta, b",
+                              "6\tCritical\t" + KOVALogConvertTime1(t + 70) + "\tadmin\td\t",
+                              "7\tInfo\t" + KOVALogConvertTime1(t + 80) + "\tadmin\td\tx\ty",
+                              "9\tInfo\t" + KOVALogConvertTime1(t + 90) + "\tadmin\td\tz",
+                          }));
+    ASSERT_EQ(KOVALogWrite(kLogTypePerfEvent, "Info", "admin", "test", "next"), 0);
+    EXPECT_EQ(Ids(Dump(root)).back(), "13");
+  }
+}
+
+// Where the output can't take an in-kernel copy (a pipe), the dump goes
+// through a buffer, however large the log.
+TEST(LogStoreTest, DumpsToAPipe) {
+  TestRoot root;
+  ASSERT_EQ(QLIBCINFOSetKeyValue(kova::kLogMaxRecordsKey, "100000"), 0);
+  std::vector<LogRecord> batch(30000, LogRecord{"Warning", 1700000000, "admin", "w", "e"});
+  for (size_t i = 0; i < batch.size(); ++i) batch[i].event = std::string(40, 'a' + i % 26);
+  ASSERT_EQ(kova::AppendLogRecords(kLogTypePerfEvent, batch), 0);
+  int pipe_fds[2];
+  ASSERT_EQ(pipe2(pipe_fds, O_CLOEXEC), 0);
+  std::string piped;
+  std::thread reader([&] {
+    char buffer[1 << 16];
+    for (ssize_t got; (got = read(pipe_fds[0], buffer, sizeof(buffer))) > 0;)
+      piped.append(buffer, got);
+  });
+  EXPECT_EQ(kova::DumpLogRecords(kLogTypePerfEvent, pipe_fds[1]), 0);
+  close(pipe_fds[1]);
+  reader.join();
+  close(pipe_fds[0]);
+  KOVALogGet1(kLogTypePerfEvent, root.Path("/tmp/dump").c_str(), "enu");
+  EXPECT_GT(piped.size(), 1u << 20);
+  EXPECT_EQ(piped, root.Read("/tmp/dump"));
 }
 
 TEST(LogStoreTest, NeverWritesThroughALink) {

@@ -1,14 +1,23 @@
-// Speed and memory of reading the performance-event log: ProcessLog and the
-// "list" method (a page of 50) over synthetic logs of 10^4 to 10^6 lines, with
-// no filter and with a keyword that half of the lines hold.
+// The "list" method of the performance-event log on the real platform, in the
+// system root $KOVA_ROOT, for bench/compare_sort.sh:
 //
-//   log_bench [benchmark flags]   runs the benchmarks
-//   log_bench --emit N            prints the synthetic log of N lines, for a
-//                                 baseline run over the same text
+//   log_bench fill ORDER N         appends N events of about 120 bytes through
+//                                  the platform's batch append; ORDER is
+//                                  "time" (oldest first), "steps" (the clock
+//                                  steps back an hour every 10^4 events) or
+//                                  "shuffled" (times in random order)
+//   log_bench list RUNS PAGE [KEYWORD]
+//                                  calls the list handler RUNS times for a page
+//                                  of 50 (with the keyword as filter), prints
+//                                  each call's time ("ms <t>") and the peak
+//                                  resident memory ("peak_kib <k>"), and writes
+//                                  the last page to PAGE as time, level and
+//                                  event, tab-separated, one entry a line
 
-#include <benchmark/benchmark.h>
+#include <time.h>
 
 #include <algorithm>
+#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -17,30 +26,42 @@
 #include <string>
 #include <vector>
 
-#include "fake/kova_fake.h"
 #include "kova/log.h"
 #include "log/log_handlers.h"
-#include "log/log_reader.h"
+#include "src/log_store.h"
 #include "test_support/host_call.h"
 
 namespace {
 
-constexpr char kKeyword[] = "latency";
 constexpr int64_t kMonthStart = 1793491200;  // 2026-11-01 00:00:00 UTC
 constexpr int64_t kMonth = 30 * 86400;
+constexpr int kStepEvery = 10000;
+constexpr int64_t kStepBack = 3600;
+constexpr size_t kBatch = 10000;
 
-// `count` lines of about 120 bytes, oldest first, their times spread over a
-// month; every other line names the keyword. The same count gives the same text.
-std::vector<std::string> SyntheticLog(int count) {
-  static const char* const kLevels[] = {"Warning", "Critical", "Info"};
+// The events' times in the order they are written. The same order and count
+// give the same times.
+std::vector<int64_t> Times(const std::string& order, int count) {
   std::mt19937 random(count);
   std::vector<int64_t> times(static_cast<size_t>(count));
   for (int64_t& time : times) time = kMonthStart + random() % kMonth;
   std::sort(times.begin(), times.end());
-  std::vector<std::string> lines;
-  lines.reserve(times.size());
+  if (order == "steps") {
+    for (size_t i = 0; i < times.size(); ++i) times[i] -= kStepBack * (i / kStepEvery % 2);
+  } else if (order == "shuffled") {
+    std::shuffle(times.begin(), times.end(), random);
+  }
+  return times;
+}
+
+int Fill(const std::string& order, int count) {
+  if (order != "time" && order != "steps" && order != "shuffled") return 2;
+  static const char* const kLevels[] = {kLogLevelWarning, kLogLevelCritical, kLogLevelInfo};
+  std::mt19937 random(count + 1);
+  std::vector<kova::LogRecord> batch;
   char event[256];
-  for (int i = 0; i < count; ++i) {
+  const std::vector<int64_t> times = Times(order, count);
+  for (size_t i = 0; i < times.size(); ++i) {
     const unsigned value = 50 + random() % 50;
     if (i % 2 == 0) {
       snprintf(event, sizeof(event),
@@ -51,84 +72,62 @@ std::vector<std::string> SyntheticLog(int count) {
                "CPU usage of service smb-%03u above 80%% for 30 s (seen %u%%), rule %u",
                static_cast<unsigned>(random() % 1000), value, value % 16);
     }
-    lines.push_back(std::to_string(i + 1) + "\t" + kLevels[i % 3] + "\t" +
-                    KOVALogConvertTime1(times[i]) + "\tSYSTEM\tkovaperfeventd\t" + event);
-  }
-  return lines;
-}
-
-// The peak resident memory of the process since the last reset, in MiB.
-double PeakResidentMiB() {
-  std::ifstream status("/proc/self/status");
-  std::string line;
-  while (std::getline(status, line)) {
-    if (line.rfind("VmHWM:", 0) == 0) return strtod(line.c_str() + 6, nullptr) / 1024.0;
+    batch.push_back({kLevels[i % 3], times[i], "SYSTEM", "kovaperfeventd", event});
+    if (batch.size() == kBatch || i + 1 == times.size()) {
+      if (kova::AppendLogRecords(kLogTypePerfEvent, batch) != 0) {
+        fprintf(stderr, "log_bench: cannot append to the log\n");
+        return 1;
+      }
+      batch.clear();
+    }
   }
   return 0;
 }
 
-// Starts a fresh peak of resident memory, where the kernel allows it.
-void ResetPeakResident() { std::ofstream("/proc/self/clear_refs") << "5"; }
-
-void Prepare(benchmark::State& state) {
-  kova_fake::Reset();
-  kova_fake::SetLogLines(SyntheticLog(static_cast<int>(state.range(0))));
-  ResetPeakResident();
-}
-
-void Report(benchmark::State& state) {
-  state.SetItemsProcessed(state.iterations() * state.range(0));
-  state.counters["peak_MiB"] = PeakResidentMiB();
-  state.SetLabel(state.range(1) ? "keyword" : "no filter");
-}
-
-void BM_ProcessLog(benchmark::State& state) {
-  Prepare(state);
-  LogFilter filter;
-  if (state.range(1)) filter.keyword = kKeyword;
-  for (auto _ : state) {
-    std::vector<Json::Value> entries;
-    if (!ProcessLog(filter, entries)) state.SkipWithError("ProcessLog failed");
-    benchmark::DoNotOptimize(entries.data());
+long PeakResidentKiB() {
+  std::ifstream status("/proc/self/status");
+  std::string line;
+  while (std::getline(status, line)) {
+    if (line.rfind("VmHWM:", 0) == 0) return strtol(line.c_str() + 6, nullptr, 10);
   }
-  Report(state);
+  return -1;
 }
 
-void BM_LogList(benchmark::State& state) {
-  Prepare(state);
+int List(int runs, const char* page_path, const char* keyword) {
   const std::string params =
-      state.range(1) ? R"({"limit": 50, "filter": {"keyword": "latency"}})" : R"({"limit": 50})";
-  for (auto _ : state) {
+      keyword != nullptr
+          ? std::string(R"({"limit": 50, "filter": {"keyword": ")") + keyword + "\"}}"
+          : R"({"limit": 50})";
+  Json::Value page;
+  for (int run = 0; run < runs; ++run) {
+    const auto start = std::chrono::steady_clock::now();
     const KOVA::APIResponse response = kova_test::CallHandler(log_list_v1, params);
-    if (response.GetData()["logs"].size() != 50) state.SkipWithError("short page");
+    const std::chrono::duration<double, std::milli> took = std::chrono::steady_clock::now() - start;
+    if (response.GetErrorCode() != 0) {
+      fprintf(stderr, "log_bench: the list failed with error %d\n", response.GetErrorCode());
+      return 1;
+    }
+    page = response.GetData()["logs"];
+    printf("ms %.2f\n", took.count());
   }
-  Report(state);
-}
-
-void Sizes(benchmark::internal::Benchmark* benchmark) {
-  benchmark->ArgNames({"lines", "keyword"});
-  for (int lines : {10000, 100000, 1000000}) {
-    for (int keyword : {0, 1}) benchmark->Args({lines, keyword});
+  printf("peak_kib %ld\n", PeakResidentKiB());
+  FILE* out = fopen(page_path, "w");
+  if (out == nullptr) return 1;
+  for (const Json::Value& entry : page) {
+    fprintf(out, "%s\t%s\t%s\n", entry["time"].asCString(), entry["level"].asCString(),
+            entry["event"].asCString());
   }
-  benchmark->Unit(benchmark::kMillisecond)->UseRealTime();
+  return fclose(out) == 0 ? 0 : 1;
 }
-
-BENCHMARK(BM_ProcessLog)->Apply(Sizes);
-BENCHMARK(BM_LogList)->Apply(Sizes);
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  if (argc == 3 && strcmp(argv[1], "--emit") == 0) {
-    for (const std::string& line : SyntheticLog(atoi(argv[2]))) {
-      fputs(line.c_str(), stdout);
-      fputc('\n', stdout);
-    }
-    return 0;
+  if (argc == 4 && strcmp(argv[1], "fill") == 0) return Fill(argv[2], atoi(argv[3]));
+  if ((argc == 4 || argc == 5) && strcmp(argv[1], "list") == 0) {
+    return List(atoi(argv[2]), argv[3], argc == 5 ? argv[4] : nullptr);
   }
-  benchmark::Initialize(&argc, argv);
-  if (benchmark::ReportUnrecognizedArguments(argc, argv)) return 1;
-  benchmark::RunSpecifiedBenchmarks();
-  benchmark::Shutdown();
-  return 0;
+  fprintf(stderr,
+          "usage: log_bench fill time|steps|shuffled N | log_bench list RUNS PAGE [KEYWORD]\n");
+  return 2;
 }

@@ -4,7 +4,9 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "fake/kova_fake.h"
@@ -111,6 +113,8 @@ TEST(LogReaderTest, SplitsLinesLikeTokenisingAtTabs) {
       // An empty level field vanishes: every later field moves one place up.
       {{"7\t\t" + kTime1 + "\tadmin\tsrc\tev"}, {Entry(kTime1, "admin", "")}, {}},
       {{Line("Critical", kTime1, "ev\r")}, {Entry("Critical", kTime1, "ev\r")}, {}},
+      // A line ends at a NUL, as a C string read into the buffer does.
+      {{Line("Info", kTime1, std::string("ab\0cd", 5))}, {Entry("Info", kTime1, "ab")}, {}},
       {{"7\tWarning\t" + kTime1 + "\tadmin", "\t7", ""},
        {},
        {"Wrong log: 7", "Wrong log: \t7", "Wrong log: "}},
@@ -125,6 +129,28 @@ TEST(LogReaderTest, SplitsLinesLikeTokenisingAtTabs) {
   for (const auto& c : cases) {
     EXPECT_THAT(Read(c.lines), ElementsAreArray(c.entries)) << ::testing::PrintToString(c.lines);
     EXPECT_THAT(WrongLogLines(), ElementsAreArray(c.wrong)) << ::testing::PrintToString(c.lines);
+  }
+}
+
+// A log many read blocks long, whose clock steps back every 500 lines: every
+// entry comes back whole from wherever it lay, newest first.
+TEST(LogReaderTest, OrdersALargeLogWithClockSteps) {
+  constexpr int kLines = 3000;
+  std::vector<std::string> lines;
+  std::vector<std::pair<std::string, std::string>> expected;  // time, event
+  for (int i = 0; i < kLines; ++i) {
+    const int block = i / 500;
+    const int64_t time = kDay1 + (block ^ 1) * 500 + i % 500;  // blocks 1, 0, 3, 2, 5, 4
+    const std::string event = "event " + std::to_string(i) + std::string(i % 97, '.');
+    lines.push_back(Line(i % 2 ? "Warning" : "Critical", KOVALogConvertTime1(time), event));
+    expected.emplace_back(KOVALogConvertTime1(time), event);
+  }
+  std::sort(expected.rbegin(), expected.rend());
+  const std::vector<Json::Value> entries = Read(lines);
+  ASSERT_EQ(entries.size(), expected.size());
+  for (size_t i = 0; i < entries.size(); ++i) {
+    ASSERT_EQ(entries[i]["time"].asString(), expected[i].first) << i;
+    ASSERT_EQ(entries[i]["event"].asString(), expected[i].second) << i;
   }
 }
 

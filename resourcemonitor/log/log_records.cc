@@ -1,57 +1,53 @@
 #include "log/log_records.h"
 
+#include <sys/mman.h>
+
 #include <algorithm>
 #include <cstring>
 
 namespace {
 
-// Texts are copied into blocks of this size, or of the text's size when larger.
-constexpr size_t kBlockSize = 1 << 20;
+constexpr int kLengthBits = 12;  // a line read in a 4096-byte buffer is shorter
+constexpr uint64_t kLengthMask = (uint64_t{1} << kLengthBits) - 1;
+constexpr uint64_t kPackedTime = uint64_t{1} << 63;
+constexpr int kLeadingFields = 5;  // id, level, time, user, source; the event text follows
 
 // The members an entry is ordered by.
 struct SortMember {
   const char* name;
-  std::string_view LogRecord::*member;
+  std::string_view LogFields::*member;
 };
 
 constexpr SortMember kSortMembers[] = {
-    {"level", &LogRecord::level},
-    {"time", &LogRecord::time},
-    {"event", &LogRecord::event},
+    {"level", &LogFields::level},
+    {"time", &LogFields::time},
+    {"event", &LogFields::event},
     {nullptr, nullptr},
 };
 
-std::string_view LogRecord::*FindMember(const std::string& name) {
+std::string_view LogFields::*FindMember(const std::string& name) {
   for (const SortMember* row = kSortMembers; row->name != nullptr; ++row) {
     if (name == row->name) return row->member;
   }
   return nullptr;
 }
 
-// An entry's place in the order: the first 16 bytes of its text packed big-end
-// first, so that most comparisons touch neither the entry nor its text.
-struct SortKey {
-  uint64_t head[2];
-  std::string_view text;
-  size_t index;
-};
-
-SortKey MakeSortKey(std::string_view text, size_t index) {
-  unsigned char bytes[16] = {};
-  memcpy(bytes, text.data(), std::min(text.size(), sizeof(bytes)));
-  SortKey key{{0, 0}, text, index};
-  for (size_t i = 0; i < sizeof(bytes); ++i) key.head[i / 8] = key.head[i / 8] << 8 | bytes[i];
-  return key;
-}
-
-// How two texts compare byte by byte. Zero padding makes heads equal only when
-// the texts share their first 16 bytes or one is a prefix of the other; the
-// texts decide then.
-int ByteOrder(const SortKey& a, const SortKey& b) {
-  for (int i = 0; i < 2; ++i) {
-    if (a.head[i] != b.head[i]) return a.head[i] < b.head[i] ? -1 : 1;
+// A time text in the log's own shape, "YYYY/MM/DD HH:MM:SS", as kPackedTime and
+// its 14 digits four bits each, first digit highest: two packed times compare
+// as their texts do. Any other text packs to 0 and is compared as text.
+uint64_t PackTime(std::string_view time) {
+  static constexpr unsigned char kDigitAt[] = {0, 1, 2, 3, 5, 6, 8, 9, 11, 12, 14, 15, 17, 18};
+  if (time.size() != 19 || time[4] != '/' || time[7] != '/' || time[10] != ' ' || time[13] != ':' ||
+      time[16] != ':') {
+    return 0;
   }
-  return a.text.compare(b.text);
+  uint64_t key = 0;
+  for (const unsigned char at : kDigitAt) {
+    const unsigned digit = static_cast<unsigned char>(time[at]) - unsigned{'0'};
+    if (digit > 9) return 0;
+    key = key << 4 | digit;
+  }
+  return kPackedTime | key;
 }
 
 Json::Value JsonText(std::string_view text) {
@@ -59,6 +55,20 @@ Json::Value JsonText(std::string_view text) {
 }
 
 }  // namespace
+
+bool SplitLogLine(std::string_view line, LogFields& fields) {
+  std::string_view found[kLeadingFields];
+  size_t at = 0;
+  for (std::string_view& field : found) {
+    while (at < line.size() && line[at] == '\t') ++at;
+    if (at == line.size()) return false;
+    const size_t end = std::min(line.find('\t', at), line.size());
+    field = line.substr(at, end - at);
+    at = end < line.size() ? end + 1 : end;
+  }
+  fields = {found[1], found[2], line.substr(at)};
+  return true;
+}
 
 LogCompare::LogCompare(std::string sortField, bool ascending)
     : sortField_(std::move(sortField)), ascending_(ascending), member_(FindMember(sortField_)) {}
@@ -76,69 +86,85 @@ std::string_view LogCompare::Text(const Json::Value& entry) const {
   return std::string_view(begin, static_cast<size_t>(end - begin));
 }
 
-std::string_view LogCompare::Text(const LogRecord& record) const {
-  return member_ != nullptr ? record.*member_ : std::string_view();
+std::string_view LogCompare::Text(const LogFields& fields) const {
+  return member_ != nullptr ? fields.*member_ : std::string_view();
 }
 
-void LogRecords::Add(std::string_view level, std::string_view time, std::string_view event) {
-  records_.push_back({Keep(level), Keep(time), Keep(event)});
+LogRecords::~LogRecords() { Clear(); }
+
+void LogRecords::Reserve(size_t count) { entries_.reserve(count); }
+
+void LogRecords::Add(uint64_t offset, size_t length, std::string_view time) {
+  entries_.push_back({PackTime(time), offset << kLengthBits | (length & kLengthMask)});
 }
 
-std::string_view LogRecords::Keep(std::string_view text) {
-  if (text.size() > free_size_) {
-    const size_t size = std::max(kBlockSize, text.size());
-    blocks_.push_back(std::make_unique_for_overwrite<char[]>(size));
-    free_begin_ = blocks_.back().get();
-    free_size_ = size;
-  }
-  char* kept = free_begin_;
-  if (!text.empty()) memcpy(kept, text.data(), text.size());
-  free_begin_ += text.size();
-  free_size_ -= text.size();
-  return std::string_view(kept, text.size());
+bool LogRecords::MapText(int fd, size_t size) {
+  if (size == 0) return true;
+  void* mapping = mmap(nullptr, size, PROT_READ, MAP_PRIVATE, fd, 0);
+  if (mapping == MAP_FAILED) return false;
+  mapping_ = mapping;
+  mapping_size_ = size;
+  text_ = std::string_view(static_cast<const char*>(mapping), size);
+  return true;
 }
 
-void LogRecords::Reserve(size_t count) { records_.reserve(count); }
+void LogRecords::AddLine(std::string_view level, std::string_view time, std::string_view event) {
+  const size_t offset = own_text_.size();
+  own_text_.append("0\t").append(level).append("\t").append(time).append("\t-\t-\t").append(event);
+  Add(offset, own_text_.size() - offset, time);
+  text_ = own_text_;
+}
 
 void LogRecords::Clear() {
-  std::vector<LogRecord>().swap(records_);
-  blocks_.clear();
-  blocks_.shrink_to_fit();
-  free_begin_ = nullptr;
-  free_size_ = 0;
+  std::vector<Place>().swap(entries_);
+  std::string().swap(own_text_);
+  if (mapping_ != nullptr) munmap(mapping_, mapping_size_);
+  mapping_ = nullptr;
+  mapping_size_ = 0;
+  text_ = {};
+}
+
+std::string_view LogRecords::Line(const Place& place) const {
+  return text_.substr(place.line >> kLengthBits, place.line & kLengthMask);
+}
+
+LogFields LogRecords::Fields(size_t index) const {
+  LogFields fields;
+  if (!SplitLogLine(Line(entries_[index]), fields)) fields = {};
+  return fields;
 }
 
 void LogRecords::Sort(const LogCompare& compare) {
-  const auto precedes = [&compare](const LogRecord& a, const LogRecord& b) {
-    return compare.Precedes(compare.Text(a).compare(compare.Text(b)));
+  // Times in the log's shape compare as numbers; other texts are read from
+  // their lines.
+  const bool by_time = compare.by_time();
+  const auto byte_order = [this, &compare, by_time](const Place& a, const Place& b) {
+    if (by_time && (a.time_key & b.time_key & kPackedTime) != 0) {
+      return a.time_key < b.time_key ? -1 : a.time_key > b.time_key ? 1 : 0;
+    }
+    LogFields fields_a;
+    LogFields fields_b;
+    SplitLogLine(Line(a), fields_a);
+    SplitLogLine(Line(b), fields_b);
+    return compare.Text(fields_a).compare(compare.Text(fields_b));
   };
-  // A log is written oldest first, so its records usually arrive in the
+  const auto precedes = [&compare, &byte_order](const Place& a, const Place& b) {
+    return compare.Precedes(byte_order(a, b));
+  };
+  // A log is written oldest first, so its entries usually arrive in the
   // reverse of the order asked for, and turning them round is enough.
-  if (std::is_sorted(records_.rbegin(), records_.rend(), precedes)) {
-    std::reverse(records_.begin(), records_.end());
+  if (std::is_sorted(entries_.rbegin(), entries_.rend(), precedes)) {
+    std::reverse(entries_.begin(), entries_.end());
     return;
   }
-  // Otherwise the texts are read once into a compact array of keys, which is
-  // sorted; the records then move to their places.
-  std::vector<SortKey> keys;
-  keys.reserve(records_.size());
-  for (size_t i = 0; i < records_.size(); ++i) {
-    keys.push_back(MakeSortKey(compare.Text(records_[i]), i));
-  }
-  std::sort(keys.begin(), keys.end(), [&compare](const SortKey& a, const SortKey& b) {
-    return compare.Precedes(ByteOrder(a, b));
-  });
-  std::vector<LogRecord> sorted;
-  sorted.reserve(records_.size());
-  for (const SortKey& key : keys) sorted.push_back(records_[key.index]);
-  records_.swap(sorted);
+  std::sort(entries_.begin(), entries_.end(), precedes);
 }
 
 Json::Value LogRecords::Entry(size_t index) const {
-  const LogRecord& record = records_[index];
+  const LogFields fields = Fields(index);
   Json::Value entry;
-  entry["event"] = JsonText(record.event);
-  entry["time"] = JsonText(record.time);
-  entry["level"] = JsonText(record.level);
+  entry["event"] = JsonText(fields.event);
+  entry["time"] = JsonText(fields.time);
+  entry["level"] = JsonText(fields.level);
   return entry;
 }

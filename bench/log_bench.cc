@@ -13,8 +13,13 @@
 //                                  resident memory ("peak_kib <k>"), and writes
 //                                  the last page to PAGE as time, level and
 //                                  event, tab-separated, one entry a line
+//   log_bench export RUNS TYPE OUT calls the export handler RUNS times with
+//                                  standard output in the file OUT, printing
+//                                  each call's time and the peak memory
 
+#include <fcntl.h>
 #include <time.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
@@ -120,6 +125,32 @@ int List(int runs, const char* page_path, const char* keyword) {
   return fclose(out) == 0 ? 0 : 1;
 }
 
+// Runs the export handler RUNS times with standard output in OUT, printing
+// each call's time.
+int Export(int runs, const char* type, const char* out_path) {
+  const std::string params = std::string(R"({"type": ")") + type + "\"}";
+  for (int run = 0; run < runs; ++run) {
+    fflush(stdout);
+    const int saved = dup(STDOUT_FILENO);
+    const int out = open(out_path, O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+    if (saved < 0 || out < 0 || dup2(out, STDOUT_FILENO) < 0) return 1;
+    close(out);
+    const auto start = std::chrono::steady_clock::now();
+    const KOVA::APIResponse response = kova_test::CallHandler(log_export_v1, params);
+    fflush(stdout);
+    const std::chrono::duration<double, std::milli> took = std::chrono::steady_clock::now() - start;
+    dup2(saved, STDOUT_FILENO);
+    close(saved);
+    if (response.IsOutputEnabled()) {
+      fprintf(stderr, "log_bench: the export failed with error %d\n", response.GetErrorCode());
+      return 1;
+    }
+    printf("ms %.2f\n", took.count());
+  }
+  printf("peak_kib %ld\n", PeakResidentKiB());
+  return 0;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -127,7 +158,9 @@ int main(int argc, char** argv) {
   if ((argc == 4 || argc == 5) && strcmp(argv[1], "list") == 0) {
     return List(atoi(argv[2]), argv[3], argc == 5 ? argv[4] : nullptr);
   }
+  if (argc == 5 && strcmp(argv[1], "export") == 0) return Export(atoi(argv[2]), argv[3], argv[4]);
   fprintf(stderr,
-          "usage: log_bench fill time|steps|shuffled N | log_bench list RUNS PAGE [KEYWORD]\n");
+          "usage: log_bench fill time|steps|shuffled N | log_bench list RUNS PAGE [KEYWORD] | "
+          "log_bench export RUNS csv|html OUT\n");
   return 2;
 }

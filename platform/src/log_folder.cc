@@ -339,17 +339,31 @@ bool LogFolder::Clear() {
 }
 
 bool LogFolder::CopyTo(int fd) const {
-  for (const int64_t first : segments_) {
-    const Fd segment(
-        openat(dir_fd_, SegmentName(first).c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+  struct Segment {
+    int fd;
+    off_t end;
+  };
+  std::vector<Segment> segments;
+  bool ok = true;
+  off_t total = 0;
+  for (size_t i = 0; ok && i < segments_.size(); ++i) {
+    Segment segment{
+        openat(dir_fd_, SegmentName(segments_[i]).c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC), 0};
     struct stat info;
-    off_t end = 0;
-    if (segment.get() < 0 || fstat(segment.get(), &info) != 0 ||
-        !WholeLinesEnd(segment.get(), info.st_size, end) || !CopyRange(segment.get(), end, fd)) {
-      return false;
-    }
+    ok = segment.fd >= 0 && fstat(segment.fd, &info) == 0 &&
+         WholeLinesEnd(segment.fd, info.st_size, segment.end);
+    if (segment.fd >= 0) segments.push_back(segment);
+    total += segment.end;
   }
-  return true;
+  // Blocks reserved at once spare the file system a reservation per page; an
+  // output that can't take it (a pipe) is written all the same.
+  const off_t start = ok ? lseek(fd, 0, SEEK_CUR) : -1;
+  if (start >= 0 && total > 0) fallocate(fd, FALLOC_FL_KEEP_SIZE, start, total);
+  for (const Segment& segment : segments) ok = ok && CopyRange(segment.fd, segment.end, fd);
+  const int saved = errno;
+  for (const Segment& segment : segments) close(segment.fd);
+  errno = saved;
+  return ok;
 }
 
 bool LogFolder::Create(const std::string& path, int64_t first_id,

@@ -259,34 +259,44 @@ TEST(LogStoreTest, TimeFormatterAgreesWithTheTimeText) {
   tzset();
 }
 
-// A reader during writes from another process sees every committed record, in
-// order, and nothing half written.
-TEST(LogStoreTest, ReaderDuringWritesSeesWholeTransactions) {
+// A reader during writes from two other processes sees every batch whole and
+// the ids in order without a gap; the writers never share an id.
+TEST(LogStoreTest, ReaderDuringWritesSeesWholeBatches) {
   TestRoot root;
+  ASSERT_EQ(QLIBCINFOSetKeyValue(kova::kLogMaxRecordsKey, "100000"), 0);
   ASSERT_EQ(KOVALogWrite(kLogTypePerfEvent, "Info", "admin", "test", "first"), 0);
   constexpr int kBatches = 100;
   constexpr int kBatch = 10;
-  const pid_t writer = fork();
-  if (writer == 0) {
-    for (int b = 0; b < kBatches; ++b) {
-      std::vector<LogRecord> batch(kBatch, LogRecord{"Warning", 1700000000 + b, "admin", "w", "e"});
-      if (kova::AppendLogRecords(kLogTypePerfEvent, batch) != 0) _exit(1);
+  pid_t writers[2];
+  for (pid_t& writer : writers) {
+    writer = fork();
+    if (writer == 0) {
+      for (int b = 0; b < kBatches; ++b) {
+        std::vector<LogRecord> batch(kBatch,
+                                     LogRecord{"Warning", 1700000000 + b, "admin", "w", "e"});
+        if (kova::AppendLogRecords(kLogTypePerfEvent, batch) != 0) _exit(1);
+      }
+      _exit(0);
     }
-    _exit(0);
   }
-  int status = -1;
   size_t dumps = 0;
-  while (waitpid(writer, &status, WNOHANG) == 0) {
+  for (int running = 2; running > 0; ++dumps) {
     const std::vector<std::string> lines = Dump(root);
-    ASSERT_EQ((lines.size() - 1) % kBatch, 0u) << "a transaction seen in part";
+    ASSERT_EQ((lines.size() - 1) % kBatch, 0u) << "a batch seen in part";
     for (size_t i = 0; i < lines.size(); ++i) {
       ASSERT_EQ(lines[i].substr(0, lines[i].find('\t')), std::to_string(i + 1));
     }
-    ++dumps;
+    for (pid_t& writer : writers) {
+      int status;
+      if (writer > 0 && waitpid(writer, &status, WNOHANG) == writer) {
+        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+        writer = -1;
+        --running;
+      }
+    }
   }
-  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
-  EXPECT_GT(dumps, 0u);
-  EXPECT_EQ(Dump(root).size(), 1u + kBatches * kBatch);
+  EXPECT_GT(dumps, 1u);
+  EXPECT_EQ(Dump(root).size(), 1u + 2 * kBatches * kBatch);
 }
 
 }  // namespace

@@ -103,8 +103,8 @@ class UpperCased {
 
 // The fields of one line of the log's copy, split in place.
 struct LogLine {
-  const char* level;
-  const char* time;
+  std::string_view level;  // each ends in a NUL
+  std::string_view time;
   const char* event;
   size_t event_length;
 };
@@ -114,14 +114,15 @@ struct LogLine {
 // what follows the one tab that ends the fifth field. Each separator that ends a
 // field is overwritten with a NUL. False when there are fewer than five fields.
 bool SplitLine(char* line, size_t length, LogLine& out) {
-  const char* fields[kLeadingFields];
+  std::string_view fields[kLeadingFields];
   char* cursor = line;
-  for (const char*& field : fields) {
+  for (std::string_view& field : fields) {
     while (*cursor == '\t') ++cursor;
     if (*cursor == '\0') return false;
-    field = cursor;
+    const char* start = cursor;
     // Fields before the event are a few bytes: a plain loop beats a call.
     while (*cursor != '\t' && *cursor != '\0') ++cursor;
+    field = std::string_view(start, static_cast<size_t>(cursor - start));
     if (*cursor == '\t') *cursor++ = '\0';
   }
   out = {fields[1], fields[2], cursor, static_cast<size_t>(line + length - cursor)};
@@ -147,9 +148,11 @@ class LineTests {
     }
     // The line's level must occur in the requested level's name, so that
     // "warn" or "WARNING" pass "Warning".
-    if (test_level_ && !level_.Contains(UpperCased(line.level, strlen(line.level)))) return false;
+    if (test_level_ && !level_.Contains(UpperCased(line.level.data(), line.level.size()))) {
+      return false;
+    }
     // Both bounds are inclusive, compared byte by byte.
-    const std::string_view time(line.time);
+    const std::string_view time = line.time;
     if (!from_.empty() && std::string_view(from_) > time) return false;
     if (!to_.empty() && std::string_view(to_) < time) return false;
     return true;

@@ -1,7 +1,7 @@
 // The system's logs.
 //
 // Each log type keeps its records (level, time, user, source, event text) apart.
-// A log that was never written has no file. Fetched as text, a record is one line
+// A log that was never written has no store. Fetched as text, a record is one line
 //   <id>\t<level>\t<time>\t<user>\t<source>\t<event>
 // where none of the first five fields is empty and the time is written as
 // KOVALogConvertTime1 writes it.
@@ -23,8 +23,9 @@ inline constexpr char kLogLevelInfo[] = "Info";
 inline constexpr char kLogLevelWarning[] = "Warning";
 inline constexpr char kLogLevelCritical[] = "Critical";
 
-// Writes the path of the file of log `type` into `path` of `size` bytes, whether
-// or not the file exists yet. Returns 0 on success, -1 for an unknown type or a
+// Writes the path of the store of log `type` (a folder) into `path` of `size`
+// bytes, whether or not the store exists yet; a log kept by an earlier version
+// is moved into it first. Returns 0 on success, -1 for an unknown type or a
 // buffer too small.
 KOVA_API int KOVALogFilePathGet(int type, char* path, size_t size);
 
@@ -45,8 +46,9 @@ KOVA_API int KOVALogClean(int type);
 // Adds a record to log `type`, stamped with the current time. `level` is one of
 // the levels above; `user` and `source` name who and what raised it; none of the
 // three may be empty. Tabs and line breaks that would split a fetched line become
-// blanks. A log keeps its newest records only (100,000 unless the key
-// "log_max_records" of kKovaInfoConf says otherwise). Returns 0 on success, -1 on
+// blanks. A log keeps its newest records: at least 100,000 unless the key
+// "log_max_records" of kKovaInfoConf says otherwise, the oldest going an eighth
+// of that at a time. Returns 0 on success, -1 on
 // failure.
 KOVA_API int KOVALogWrite(int type, const char* level, const char* user, const char* source,
                           const char* event);

@@ -52,6 +52,30 @@ std::string ObjectPhrase(const Rule& rule, const std::string& name) {
 
 }  // namespace
 
+std::string ResourceLabel(int32_t resource) {
+  switch (resource) {
+    case PERFEVENT_RESOURCE_CPU:
+      return "cpu";
+    case PERFEVENT_RESOURCE_MEMORY:
+      return "memory";
+    case PERFEVENT_RESOURCE_IO_RATE:
+      return "io_rate";
+    case PERFEVENT_RESOURCE_IO_LATENCY:
+      return "io_latency";
+    default:
+      return "resource" + std::to_string(resource);
+  }
+}
+
+std::string ObjectLabel(const Rule& rule, const std::string& object_name) {
+  if (rule.type == PERFEVENT_TYPE_SYSTEM) return "system";
+  std::string label = object_name;
+  for (char& c : label) {
+    if (c == '\t' || c == '\n' || c == '\r') c = ' ';
+  }
+  return label;
+}
+
 std::string RuleSubject(const Rule& rule, const std::string& object_name) {
   return ResourceName(rule.resource) + " of " + ObjectPhrase(rule, object_name);
 }

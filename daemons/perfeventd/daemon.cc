@@ -161,12 +161,13 @@ class Daemon {
     const std::vector<Firing> firings = monitor_.Firings();
     std::set<std::string> firing_ids;
     for (const Firing& firing : firings) firing_ids.insert(firing.rule_id);
+    queue_.Add(events);
+    queue_.Flush();
+    state_.Publish(StateText(counts_, firings));
+    // Logged first: an alert's text is the event's as logged.
     book_.Take(events);
     book_.KeepOnly(firing_ids, now);
     poster_.Post(book_.Due(WallNow()));
-    queue_.Add(events);
-    queue_.Flush();
-    PublishState();
   }
 
   void PublishState() { state_.Publish(StateText(counts_, monitor_.Firings())); }

@@ -65,7 +65,7 @@ void EventQueue::Restore() {
 
 void EventQueue::Add(const std::vector<Event>& events) {
   for (const Event& event : events) {
-    events_.push_back(Event{event.time, event.level, OneLine(event.text), {}});
+    events_.push_back(Event{event.time, event.level, OneLine(event.text)});
     changed_ = true;
   }
   while (events_.size() > capacity_) {

@@ -27,7 +27,7 @@ struct Event {
   int64_t time = 0;   // seconds since the epoch, when it was decided
   std::string level;  // "Warning", "Critical" or "Info"
   std::string text;
-  EventOrigin origin;
+  EventOrigin origin = {};
 
   bool operator==(const Event&) const = default;
 };

@@ -58,7 +58,7 @@ TEST(EventTextTest, NamesResourceObjectThresholdValueAndDuration) {
   };
   for (const auto& c : cases) {
     const Event event = DescribeChange(c.rule, c.name, c.raised, c.average, 1700000000);
-    EXPECT_EQ(event, (Event{1700000000, c.level, c.text, {}})) << c.rule.id;
+    EXPECT_EQ(event, (Event{1700000000, c.level, c.text})) << c.rule.id;
   }
 }
 

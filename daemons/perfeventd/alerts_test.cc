@@ -69,8 +69,9 @@ TEST(AlertsTest, EndpointsTakeHttpUrlsOnceAndRefuseTheRest) {
       {" http://a:9093/ ,HTTPS://b/am//, http://a:9093",
        {"http://a:9093/api/v2/alerts", "HTTPS://b/am/api/v2/alerts"},
        {}},
-      {"ftp://a,http://,http:///x,a:9093,http://a b,https://a\"", {}, {"ftp://a", "http://",
-       "http:///x", "a:9093", "http://a b", "https://a\""}},
+      {"ftp://a,http://,http:///x,a:9093,http://a b,https://a\"",
+       {},
+       {"ftp://a", "http://", "http:///x", "a:9093", "http://a b", "https://a\""}},
       {"file:///etc/passwd, https://am.example:443",
        {"https://am.example:443/api/v2/alerts"},
        {"file:///etc/passwd"}},
@@ -108,14 +109,20 @@ TEST(AlertBookTest, OpensResendsAndResolvesAlerts) {
     int64_t now;
     std::vector<std::string> due;
   } steps[] = {
-      {{Change("1", PERFEVENT_RESOURCE_CPU, "Critical", true, 100)}, {"1"}, 100,
+      {{Change("1", PERFEVENT_RESOURCE_CPU, "Critical", true, 100)},
+       {"1"},
+       100,
        {"1 firing since 100"}},
       {{}, {"1"}, 130, {}},
       {{}, {"1"}, 160, {"1 firing since 100"}},  // re-sent a minute later
-      {{Change("2", PERFEVENT_RESOURCE_MEMORY, "Warning", true, 170)}, {"1", "2"}, 170,
+      {{Change("2", PERFEVENT_RESOURCE_MEMORY, "Warning", true, 170)},
+       {"1", "2"},
+       170,
        {"2 firing since 170"}},
       // A recovery is posted at once, whatever the re-send time.
-      {{Change("1", PERFEVENT_RESOURCE_CPU, "Info", false, 200)}, {"2"}, 200,
+      {{Change("1", PERFEVENT_RESOURCE_CPU, "Info", false, 200)},
+       {"2"},
+       200,
        {"1 resolved at 200"}},
       {{}, {"2"}, 229, {}},
       {{}, {"2"}, 230, {"2 firing since 170"}},
@@ -143,13 +150,17 @@ TEST(AlertBookTest, LabelsNameTheRuleObjectAndBox) {
     const char* level;
     std::map<std::string, std::string> labels;
   } cases[] = {
-      {PERFEVENT_RESOURCE_CPU, "Critical",
+      {PERFEVENT_RESOURCE_CPU,
+       "Critical",
        {{"alertname", "KovaCpuHigh"}, {"severity", "critical"}, {"resource", "cpu"}}},
-      {PERFEVENT_RESOURCE_MEMORY, "Warning",
+      {PERFEVENT_RESOURCE_MEMORY,
+       "Warning",
        {{"alertname", "KovaMemoryHigh"}, {"severity", "warning"}, {"resource", "memory"}}},
-      {PERFEVENT_RESOURCE_IO_RATE, "Warning",
+      {PERFEVENT_RESOURCE_IO_RATE,
+       "Warning",
        {{"alertname", "KovaIoRateHigh"}, {"severity", "warning"}, {"resource", "io_rate"}}},
-      {PERFEVENT_RESOURCE_IO_LATENCY, "Critical",
+      {PERFEVENT_RESOURCE_IO_LATENCY,
+       "Critical",
        {{"alertname", "KovaIoLatencyHigh"}, {"severity", "critical"}, {"resource", "io_latency"}}},
   };
   for (const auto& c : cases) {
@@ -191,7 +202,7 @@ TEST(AlertOutboxTest, RetriesWithBackoffAndDropsOldestAndSpent) {
       {"fail", {}, 0, {}, 0, 3, 1},
       {"take", {}, 0.5, {}, 0, 3, 1},  // backing off
       {"take", {}, 1, {"b", "c"}, 0, 3, 1},
-      {"fail", {}, 1, {}, 2, 1, 3},  // "b" and "c" out of attempts
+      {"fail", {}, 1, {}, 2, 1, 3},     // "b" and "c" out of attempts
       {"add", {"d!"}, 2, {}, 0, 1, 3},  // replaces the waiting "d"
       {"take", {}, 3, {"d!"}, 0, 1, 3},
       {"add", {"d"}, 3, {}, 0, 1, 3},  // while posting: newer, stays

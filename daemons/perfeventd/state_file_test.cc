@@ -20,9 +20,7 @@ TEST(StateFileTest, TextHoldsEveryLevelAndEachFiringRule) {
     std::vector<Firing> firings;
     const char* text;
   } cases[] = {
-      {{},
-       {},
-       "events_total\tInfo\t0\nevents_total\tWarning\t0\nevents_total\tCritical\t0\n"},
+      {{}, {}, "events_total\tInfo\t0\nevents_total\tWarning\t0\nevents_total\tCritical\t0\n"},
       {{{1, "Warning", "a"}, {2, "Critical", "b"}, {3, "Warning", "c"}, {4, "Info", "d"}},
        {{"3", "system", PERFEVENT_RESOURCE_MEMORY},
         {"12", "Web\tserver\nA", PERFEVENT_RESOURCE_CPU},

@@ -297,6 +297,12 @@ TEST_F(AlertsE2eTest, UnreachableAlertmanagersHoldUpNoCycle) {
   EXPECT_THAT(log, HasSubstr("perfevent_alertmanager_urls: \"ftp://127.0.0.1/\" is not an "
                              "http:// or https:// URL; ignored"));
   EXPECT_THAT(log, HasSubstr("can't post alerts to " + closed_url + "/api/v2/alerts"));
+  // The settings are read again on SIGHUP.
+  root_.Write("/etc/kovainfo.conf", "perfevent_alertmanager_urls=\"\"\n");
+  ASSERT_EQ(kill(daemon_->pid(), SIGHUP), 0);
+  EXPECT_TRUE(WaitFor(5, [&] {
+    return root_.Read("/daemon.err").find("alerts are posted nowhere") != std::string::npos;
+  })) << root_.Read("/daemon.err");
   // A stop does not wait for the silent listener either.
   const auto stopping = Clock::now();
   EXPECT_EQ(daemon_->Stop(), 0);

@@ -131,7 +131,7 @@ void AlertBook::Take(const std::vector<Event>& events) {
         {"instance", instance_},
         {"rule", origin.rule_id},
     };
-    entry.alert.text = event.text;
+    entry.alert.text = OneLine(event.text);  // as the log holds it
     entry.alert.starts_at = event.time;
     entries_[origin.rule_id] = std::move(entry);
   }

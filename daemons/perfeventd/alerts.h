@@ -6,7 +6,7 @@
 // KovaIoLatencyHigh), severity ("warning", "critical"), resource, object,
 // instance and rule (the rule id, so that two rules on one object stay two
 // alerts). The annotations summary and description hold the event's text as
-// logged.
+// logged (on one line).
 
 #ifndef KOVA_DAEMONS_PERFEVENTD_ALERTS_H_
 #define KOVA_DAEMONS_PERFEVENTD_ALERTS_H_

@@ -84,7 +84,7 @@ TEST(AlertsTest, EndpointsTakeHttpUrlsOnceAndRefuseTheRest) {
 }
 
 Event Change(const char* rule, int32_t resource, const char* level, bool raised, int64_t time) {
-  return Event{time, level, std::string(raised ? "up " : "down ") + rule,
+  return Event{time, level, std::string(raised ? "up\t" : "down ") + rule,
                EventOrigin{rule, std::string("obj-") + rule, resource, raised}};
 }
 

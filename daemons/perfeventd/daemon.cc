@@ -45,12 +45,6 @@ constexpr char kAlertInstanceKey[] = "perfevent_alert_instance";
 // minutes by default): a firing alert is posted again every minute.
 constexpr double kResendSeconds = 60;
 
-double WallNow() {
-  timespec now;
-  clock_gettime(CLOCK_REALTIME, &now);
-  return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
-}
-
 std::string HostName() {
   char name[256] = "";
   if (gethostname(name, sizeof(name) - 1) != 0) return "localhost";
@@ -167,7 +161,7 @@ class Daemon {
     // Logged first: an alert's text is the event's as logged.
     book_.Take(events);
     book_.KeepOnly(firing_ids, now);
-    poster_.Post(book_.Due(WallNow()));
+    poster_.Post(book_.Due(Now()));
   }
 
   void PublishState() { state_.Publish(StateText(counts_, monitor_.Firings())); }

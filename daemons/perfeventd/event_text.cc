@@ -67,13 +67,15 @@ std::string ResourceLabel(int32_t resource) {
   }
 }
 
-std::string ObjectLabel(const Rule& rule, const std::string& object_name) {
-  if (rule.type == PERFEVENT_TYPE_SYSTEM) return "system";
-  std::string label = object_name;
-  for (char& c : label) {
+std::string OneLine(std::string text) {
+  for (char& c : text) {
     if (c == '\t' || c == '\n' || c == '\r') c = ' ';
   }
-  return label;
+  return text;
+}
+
+std::string ObjectLabel(const Rule& rule, const std::string& object_name) {
+  return rule.type == PERFEVENT_TYPE_SYSTEM ? "system" : OneLine(object_name);
 }
 
 std::string RuleSubject(const Rule& rule, const std::string& object_name) {

@@ -32,6 +32,10 @@ struct Event {
   bool operator==(const Event&) const = default;
 };
 
+// `text` with tabs and line breaks made blanks, as the log and the state file
+// take it: one line, no field separator.
+std::string OneLine(std::string text);
+
 // The resource as labels and the state file name it: "cpu", "memory",
 // "io_rate", "io_latency"; "resource<N>" for one no rule can watch.
 std::string ResourceLabel(int32_t resource);

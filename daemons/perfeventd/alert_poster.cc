@@ -104,7 +104,8 @@ void AlertPoster::Post(const std::vector<Alert>& alerts) {
       std::lock_guard<std::mutex> lock(worker->mutex);
       const size_t dropped = worker->outbox.Add(alerts);
       if (dropped > 0 && worker->dropped == 0) {
-        notify_(LOG_ERR, "the alerts waiting for " + url + " are too many; the oldest are dropped");
+        notify_(LOG_ERR, "the alerts waiting for " + UrlForLog(url) +
+                             " are too many; the oldest are dropped");
       }
       worker->dropped += dropped;
     }
@@ -133,11 +134,11 @@ void AlertPoster::Run(Worker& worker) {
     if (worker.stop) break;
     worker.dropped += worker.outbox.Done(batch, posted, SteadyNow());
     if (!posted && !worker.failing) {
-      notify_(LOG_WARNING,
-              "can't post alerts to " + worker.url + ": " + error + "; they wait and are retried");
+      notify_(LOG_WARNING, "can't post alerts to " + UrlForLog(worker.url) + ": " + error +
+                               "; they wait and are retried");
     }
     if (posted && worker.failing) {
-      notify_(LOG_INFO, "alerts reach " + worker.url + " again" +
+      notify_(LOG_INFO, "alerts reach " + UrlForLog(worker.url) + " again" +
                             (worker.dropped > 0 ? " (" + std::to_string(worker.dropped) +
                                                       " were dropped meanwhile)"
                                                 : ""));

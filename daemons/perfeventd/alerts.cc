@@ -110,6 +110,15 @@ std::vector<std::string> AlertmanagerEndpoints(const std::string& setting,
   return endpoints;
 }
 
+std::string UrlForLog(const std::string& url) {
+  const size_t host = url.find("://");
+  if (host == std::string::npos) return url;
+  const size_t end = url.find_first_of("/?#", host + 3);
+  const size_t at = url.rfind('@', end == std::string::npos ? url.size() : end);
+  if (at == std::string::npos || at < host + 3) return url;
+  return url.substr(0, host + 3) + "***" + url.substr(at);
+}
+
 void AlertBook::Take(const std::vector<Event>& events) {
   for (const Event& event : events) {
     const EventOrigin& origin = event.origin;

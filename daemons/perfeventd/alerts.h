@@ -47,6 +47,9 @@ std::string AlertName(int32_t resource);
 std::vector<std::string> AlertmanagerEndpoints(const std::string& setting,
                                                std::vector<std::string>& refused);
 
+// `url` as the system log may show it: a user and password in it made "***".
+std::string UrlForLog(const std::string& url);
+
 // The alerts of the raised rules, and which of them are due to be posted. A
 // firing alert is posted when it opens and again every `resend_seconds`, so
 // that Alertmanager, which times out an alert not heard of for its

@@ -83,6 +83,19 @@ TEST(AlertsTest, EndpointsTakeHttpUrlsOnceAndRefuseTheRest) {
   }
 }
 
+TEST(AlertsTest, UrlsForTheLogHideUserAndPassword) {
+  const struct {
+    const char* url;
+    const char* shown;
+  } cases[] = {
+      {"http://127.0.0.1:9093/api/v2/alerts", "http://127.0.0.1:9093/api/v2/alerts"},
+      {"https://kova:s3cret@am:9093/api/v2/alerts", "https://***@am:9093/api/v2/alerts"},
+      {"http://a:b@c@am/x?to=u@v", "http://***@am/x?to=u@v"},
+      {"http://am/path@x", "http://am/path@x"},
+  };
+  for (const auto& c : cases) EXPECT_EQ(UrlForLog(c.url), c.shown);
+}
+
 Event Change(const char* rule, int32_t resource, const char* level, bool raised, int64_t time) {
   return Event{time, level, std::string(raised ? "up\t" : "down ") + rule,
                EventOrigin{rule, std::string("obj-") + rule, resource, raised}};

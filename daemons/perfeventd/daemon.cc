@@ -183,12 +183,13 @@ class Daemon {
     std::vector<std::string> refused;
     const std::vector<std::string> endpoints = AlertmanagerEndpoints(urls, refused);
     for (const std::string& url : refused) {
-      Log(LOG_ERR, std::string(kAlertmanagerUrlsKey) + ": \"" + url +
+      Log(LOG_ERR, std::string(kAlertmanagerUrlsKey) + ": \"" + UrlForLog(url) +
                        "\" is not an http:// or https:// URL; ignored");
     }
     poster_.SetUrls(endpoints);
     std::string list;
-    for (const std::string& endpoint : endpoints) list += (list.empty() ? "" : ", ") + endpoint;
+    for (const std::string& endpoint : endpoints)
+      list += (list.empty() ? "" : ", ") + UrlForLog(endpoint);
     Log(LOG_INFO, endpoints.empty() ? "alerts are posted nowhere" : "alerts are posted to " + list);
   }
 

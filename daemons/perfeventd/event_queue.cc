@@ -17,14 +17,6 @@ namespace {
 constexpr char kUser[] = "SYSTEM";
 constexpr char kSource[] = "kovaperfeventd";
 
-// The text with what would break a line of the file made blanks.
-std::string OneLine(std::string text) {
-  for (char& c : text) {
-    if (c == '\t' || c == '\n' || c == '\r') c = ' ';
-  }
-  return text;
-}
-
 }  // namespace
 
 EventQueue::EventQueue(std::string spill_path, size_t capacity, Notify notify)

@@ -52,6 +52,32 @@ std::string ObjectPhrase(const Rule& rule, const std::string& name) {
 
 }  // namespace
 
+std::string ResourceLabel(int32_t resource) {
+  switch (resource) {
+    case PERFEVENT_RESOURCE_CPU:
+      return "cpu";
+    case PERFEVENT_RESOURCE_MEMORY:
+      return "memory";
+    case PERFEVENT_RESOURCE_IO_RATE:
+      return "io_rate";
+    case PERFEVENT_RESOURCE_IO_LATENCY:
+      return "io_latency";
+    default:
+      return "resource" + std::to_string(resource);
+  }
+}
+
+std::string OneLine(std::string text) {
+  for (char& c : text) {
+    if (c == '\t' || c == '\n' || c == '\r') c = ' ';
+  }
+  return text;
+}
+
+std::string ObjectLabel(const Rule& rule, const std::string& object_name) {
+  return rule.type == PERFEVENT_TYPE_SYSTEM ? "system" : OneLine(object_name);
+}
+
 std::string RuleSubject(const Rule& rule, const std::string& object_name) {
   return ResourceName(rule.resource) + " of " + ObjectPhrase(rule, object_name);
 }

@@ -114,11 +114,22 @@ std::vector<Event> Monitor::Cycle(const Measurements& measurements, int64_t now)
     state.missing = false;
     const RuleWindow::Change change = state.window.Feed(sample);
     if (change == RuleWindow::Change::kNone) continue;
-    events.push_back(
-        DescribeChange(state.rule, directory_.DisplayName(state.rule.type, state.rule.object),
-                       change == RuleWindow::Change::kRaised, state.window.average(), now));
+    const bool raised = change == RuleWindow::Change::kRaised;
+    const std::string name = directory_.DisplayName(state.rule.type, state.rule.object);
+    Event event = DescribeChange(state.rule, name, raised, state.window.average(), now);
+    if (raised) state.shown = ObjectLabel(state.rule, name);
+    event.origin = {state.rule.id, state.shown, state.rule.resource, raised};
+    events.push_back(std::move(event));
   }
   return events;
+}
+
+std::vector<Firing> Monitor::Firings() const {
+  std::vector<Firing> firings;
+  for (const RuleState& state : states_) {
+    if (state.window.raised()) firings.push_back({state.rule.id, state.shown, state.rule.resource});
+  }
+  return firings;
 }
 
 Measured Monitor::Measure(const Rule& rule, const Measurements& measurements) {

@@ -23,6 +23,15 @@ namespace perfeventd {
 // Receives a line for the system log at a syslog priority.
 using Notify = std::function<void(int priority, const std::string& text)>;
 
+// A rule whose condition holds now: raised and not recovered since.
+struct Firing {
+  std::string rule_id;
+  std::string object;  // ObjectLabel of the rule when it was raised
+  int32_t resource = 0;
+
+  bool operator==(const Firing&) const = default;
+};
+
 class Monitor {
  public:
   Monitor(sampling::ObjectDirectory& directory, Notify notify);
@@ -37,6 +46,9 @@ class Monitor {
   // What the pass over /proc of each cycle must read for these rules.
   sampling::SampleNeeds Needs() const;
   size_t rule_count() const { return states_.size(); }
+  // The rules raised and not recovered, in the store's order. A rule changed,
+  // removed or turned off is not among them any more.
+  std::vector<Firing> Firings() const;
 
   // Runs one cycle over `measurements`, which were advanced to this cycle's
   // pass, and returns the events decided, stamped `now`.
@@ -56,6 +68,7 @@ class Monitor {
     sampling::Reading sum;  // their readings
     bool missing = false;   // whether one of them had none
     std::string said;       // the problem last said of the rule, empty when none
+    std::string shown;      // ObjectLabel when the rule was last raised
   };
 
   sampling::Measured Measure(const Rule& rule, const sampling::Measurements& measurements);

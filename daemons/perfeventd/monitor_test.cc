@@ -182,5 +182,35 @@ TEST_F(MonitorTest, PeriodsOfSeveralCyclesAndLunDevices) {
   EXPECT_EQ(monitor_->CycleSeconds(), 3);
 }
 
+TEST_F(MonitorTest, FiringRulesAreTheRaisedOnesWithTheirObjects) {
+  directory_.services["smb"] = RecordedProcess{10, 50};
+  const Rule system = MakeRule("1", 0, "NAS", PERFEVENT_RESOURCE_MEMORY, 1, 50);
+  const Rule service = MakeRule("2", 1, "smb", PERFEVENT_RESOURCE_MEMORY, 2, 50);
+  Rule changed = service;
+  changed.threshold = 60;
+  monitor_->SetRules({system, service});
+  Cycle(70);
+  EXPECT_THAT(monitor_->Firings(), ElementsAre());
+  std::vector<EventOrigin> origins;
+  for (const Event& event : monitor_->Cycle(measurements_, 1000)) origins.push_back(event.origin);
+  EXPECT_THAT(origins, ElementsAre(EventOrigin{"1", "system", PERFEVENT_RESOURCE_MEMORY, true},
+                                   EventOrigin{"2", "N-smb", PERFEVENT_RESOURCE_MEMORY, true}));
+  const struct {
+    const char* name;
+    std::vector<Rule> rules;
+    std::vector<Firing> firings;
+  } cases[] = {
+      {"kept",
+       {system, service},
+       {{"1", "system", PERFEVENT_RESOURCE_MEMORY}, {"2", "N-smb", PERFEVENT_RESOURCE_MEMORY}}},
+      {"one changed", {system, changed}, {{"1", "system", PERFEVENT_RESOURCE_MEMORY}}},
+      {"all removed", {}, {}},
+  };
+  for (const auto& c : cases) {
+    monitor_->SetRules(c.rules);
+    EXPECT_EQ(monitor_->Firings(), c.firings) << c.name;
+  }
+}
+
 }  // namespace
 }  // namespace perfeventd

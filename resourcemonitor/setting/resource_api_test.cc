@@ -88,9 +88,6 @@ TEST_F(SettingTest, GetReportsSwitchesOnlyForExactYes) {
     EXPECT_EQ(response.GetData()["enable_history"], c.on) << label;
     EXPECT_EQ(response.GetData()["enable_event"], c.stored == "yes") << label;
   }
-  kova_fake::Reset();
-  EXPECT_EQ(CallHandler(get_v1).GetData(), ParseJson(R"({"duration": 15, "enable_history": false,
-                                                         "enable_event": false})"));
 }
 
 TEST_F(SettingTest, GetStopsAtTheFirstKeyItCannotRead) {

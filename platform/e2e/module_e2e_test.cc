@@ -303,28 +303,4 @@ TEST_F(ModuleTest, RulesAreStoredNamedSwitchedAndDeleted) {
   EXPECT_EQ(info.st_uid, 0u);
 }
 
-// A rule's parameters may all be left out: the module writes them as 0, empty
-// and off, and the store keeps what it writes.
-TEST_F(ModuleTest, RulesWithParametersLeftOutAreKeptAsWritten) {
-  const char* bare = R"({"id": "1", "enable": false, "service": "", "name": "", "type": 0,
-                         "severity": 0, "resource": 0, "threshold": 0})";
-  EXPECT_TRUE(AsHost([&] {
-    // A change that leaves every parameter out.
-    ASSERT_EQ(Call(kRule, "set", R"({"service": "smb", "type": 1, "resource": 1, "severity": 1,
-                                     "threshold": 80, "enable": true})")
-                  .GetState(),
-              KOVA::APIResponse::State::kSuccess);
-    EXPECT_EQ(Call(kRule, "set", R"({"id": "1"})").GetState(), KOVA::APIResponse::State::kSuccess);
-    EXPECT_EQ(Call(kRule, "get", R"({"id": "1"})").GetData(), ParseJson(bare));
-    // A bare create is the same rule again, which the store holds only once.
-    EXPECT_EQ(Call(kRule, "set", "{}").GetErrorCode(), 6106);
-    EXPECT_EQ(Call(kRule, "delete", R"({"id_list": ["1"]})").GetState(),
-              KOVA::APIResponse::State::kSuccess);
-    EXPECT_EQ(Call(kRule, "set", "{}").GetState(), KOVA::APIResponse::State::kSuccess);
-    Json::Value created = ParseJson(bare);
-    created["id"] = "2";
-    EXPECT_EQ(Call(kRule, "get", R"({"id": "2"})").GetData(), created);
-  }));
-}
-
 }  // namespace

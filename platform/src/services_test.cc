@@ -323,31 +323,10 @@ while :; do sleep 0.05; done
   }
 }
 
-TEST_F(ServicesTest, DisplayNames) {
-  kova::MakeDirectories(root_.Path("/var/packages/photos"), 0755);
-  root_.Write("/etc/kova/services/plain.conf", "command=\"/bin/true\"\n");
-  const struct {
-    const char* name;
-    size_t size;
-    int result;
-    const char* display;
-  } cases[] = {
-      {"demo", 64, 0, "Demo service"},
-      {"plain", 64, 0, "plain"},
-      {"pkgctl-photos", 64, 0, "pkgctl-photos"},
-      {"pkgctl-absent", 64, -1, ""},
-      {"pkgctl-", 64, -1, ""},
-      {"demo", 12, -1, ""},
-  };
-  for (const auto& c : cases) {
-    char display[64] = "";
-    EXPECT_EQ(QLIBServicecfgDisplayNameGet(c.name, display, c.size), c.result) << c.name;
-    EXPECT_STREQ(display, c.display) << c.name;
-  }
-  EXPECT_EQ(kova::ListServices(), (std::vector<std::string>{"demo", "plain"}));
-}
-
+// The platform's own call answers a service's description; the name users see
+// comes from its package's INFO where the description names none of its own.
 TEST_F(ServicesTest, KnownServicesWithPackagesAndTheNamesUsersSee) {
+  root_.Write("/etc/kova/services/plain.conf", "command=\"/bin/true\"\n");
   root_.Write("/var/packages/Photos/INFO", "displayname=\"Photo Station\"\n");
   root_.Write("/var/packages/Media/INFO",
               "displayname=\"Media\"\ndisplayname_enu=\"Media Server\"\n");
@@ -357,20 +336,35 @@ TEST_F(ServicesTest, KnownServicesWithPackagesAndTheNamesUsersSee) {
   root_.Write("/etc/kova/services/pkgctl-Media.conf", "package=\"Media\"\n");
   root_.Write("/etc/kova/services/pkgctl-Photos.conf",
               "package=\"Photos\"\ndisplay_name=\"Photos (own name)\"\n");
-  EXPECT_EQ(kova::ListKnownServices(),
-            (std::vector<std::string>{"demo", "pkgctl-Bare", "pkgctl-Media", "pkgctl-Photos"}));
+  EXPECT_EQ(kova::ListServices(),
+            (std::vector<std::string>{"demo", "pkgctl-Media", "pkgctl-Photos", "plain"}));
+  EXPECT_EQ(
+      kova::ListKnownServices(),
+      (std::vector<std::string>{"demo", "pkgctl-Bare", "pkgctl-Media", "pkgctl-Photos", "plain"}));
   const struct {
     const char* name;
-    const char* display;
+    int result;           // of QLIBServicecfgDisplayNameGet
+    const char* display;  // what it writes
+    const char* shown;    // kova::ServiceDisplayName
   } cases[] = {
-      {"demo", "Demo service"},
-      {"pkgctl-Media", "Media Server"},
-      {"pkgctl-Photos", "Photos (own name)"},
-      {"pkgctl-Bare", "pkgctl-Bare"},
-      {"unknown", "unknown"},
-      {"../demo", "../demo"},
+      {"demo", 0, "Demo service", "Demo service"},
+      {"plain", 0, "plain", "plain"},
+      {"pkgctl-Media", 0, "pkgctl-Media", "Media Server"},
+      {"pkgctl-Photos", 0, "Photos (own name)", "Photos (own name)"},
+      {"pkgctl-Bare", 0, "pkgctl-Bare", "pkgctl-Bare"},
+      {"pkgctl-absent", -1, "", "pkgctl-absent"},
+      {"pkgctl-", -1, "", "pkgctl-"},
+      {"../demo", -1, "", "../demo"},
   };
-  for (const auto& c : cases) EXPECT_EQ(kova::ServiceDisplayName(c.name), c.display) << c.name;
+  for (const auto& c : cases) {
+    char display[64] = "";
+    EXPECT_EQ(QLIBServicecfgDisplayNameGet(c.name, display, sizeof(display)), c.result) << c.name;
+    EXPECT_STREQ(display, c.display) << c.name;
+    EXPECT_EQ(kova::ServiceDisplayName(c.name), c.shown) << c.name;
+  }
+  char short_buffer[12] = "";  // one short of "Demo service" and its end
+  EXPECT_EQ(QLIBServicecfgDisplayNameGet("demo", short_buffer, sizeof(short_buffer)), -1);
+  EXPECT_STREQ(short_buffer, "");
 }
 
 // A process that ignores SIGTERM is killed once the grace time is over.

@@ -63,22 +63,6 @@ TEST(ModuleTest, TablesEndWithTheirZeroRowAndEveryRowCanBeCalled) {
   }));
 }
 
-TEST(ModuleTest, AnswersSettingsThroughTheTable) {
-  EXPECT_TRUE(RunInChild([] {
-    kova_fake::Reset();
-    Module module = Load();
-    ASSERT_NE(module.table, nullptr);
-    kova_fake::SetConf("/etc/kovainfo.conf", "resourcemonitor_realtime_max", "60");
-    kova_fake::SetConf("/etc/kovainfo.conf", "resourcemonitor_performance_event", "yes");
-    KOVA::APIResponse got = Call(module, kSetting, "get", "{}");
-    EXPECT_EQ(got.GetData(), ParseJson(R"({"duration": 60, "enable_history": false,
-                                           "enable_event": true})"));
-    KOVA::APIResponse set = Call(module, kSetting, "set", R"({"duration": 120})");
-    EXPECT_EQ(set.GetState(), KOVA::APIResponse::State::kSuccess);
-    EXPECT_EQ(kova_fake::GetConf("/etc/kovainfo.conf", "resourcemonitor_realtime_max"), "120");
-  }));
-}
-
 // A fresh process has never filled its error record: a failure that sets no
 // code, or only a code, reports the record as it was created.
 TEST(ModuleTest, FirstFailuresOfAFreshProcessReportTheInitialRecord) {

@@ -1,8 +1,9 @@
-// Sign-in, sign-out and an expired session, in English and German.
+// Sign-in, sign-out and an expired session, in English and German; in German
+// also the settings' refusal of history without a database.
 
 import assert from 'node:assert/strict';
 import {test} from 'node:test';
-import {openPage, screenshot, signIn, useSystem} from './system.mjs';
+import {openPage, screenshot, signIn, useSystem, waitFor} from './system.mjs';
 
 let system;
 let browser;
@@ -27,15 +28,21 @@ test('a wrong password is refused in words, the right one signs in, sign-out ret
   await context.close();
 });
 
-test('a session that ends on the server brings back the sign-in with the reason', async () => {
+test('in German, a setting refused says why, and a session that ends on the server brings back the sign-in with the reason', async () => {
   const {context, page, problems} = await openPage(browser, system.url, {locale: 'de-DE'});
   await page.getByLabel('Konto').fill('admin');
   await page.getByLabel('Passwort').fill('browser test password');
   await page.getByRole('button', {name: 'Anmelden'}).click();
   await page.getByRole('navigation', {name: 'Ansichten'}).waitFor();
-  // From a screen that doesn't poll, so that the next call is the click's.
+  // No volume holds the database: history stays off, and the form reads back.
   await page.getByRole('link', {name: 'Einstellungen'}).click();
-  await page.getByLabel('Echtzeitbereich').waitFor();
+  const history = page.getByLabel('Verlauf aufzeichnen');
+  await history.check();
+  await page.getByRole('button', {name: 'Übernehmen'}).click();
+  await page.getByRole('alert').getByText('Kein Volume enthält die Verlaufsdatenbank.').waitFor();
+  await waitFor(async () => !(await history.isChecked()), 'the form read back');
+  await screenshot(page, 'settings-error-de');
+  // From a screen that doesn't poll, so that the next call is the click's.
   await context.clearCookies();
   await page.getByRole('link', {name: 'Ereignisprotokoll'}).click();
   await page.getByText('Ihre Sitzung ist abgelaufen. Bitte melden Sie sich erneut an.').waitFor();

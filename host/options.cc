@@ -25,8 +25,7 @@ const char kUsage[] =
     "  --body-timeout SECONDS    to send a request's body (30)\n"
     "  --keepalive-timeout SECONDS\n"
     "                            a connection idle between requests is closed (60)\n"
-    "  --send-timeout SECONDS    a client that takes no part of an answer (256 KiB)\n"
-    "                            for SECONDS is cut off (60)\n";
+    "  --send-timeout SECONDS    to take an answer, or each 256 KiB of a download (60)\n";
 
 namespace {
 

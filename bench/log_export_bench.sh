@@ -32,6 +32,8 @@ fail() {
 
 # A call may take long on a large log: the export is measured, not cut short.
 start_host log_fill -- --call-timeout 3600
+# The store keeps the newest 10^5 records unless told to keep more.
+echo "log_max_records=\"$events\"" >>"$root/etc/kovainfo.conf"
 "$build/bench/log_fill" "$events"
 echo "kova-webapid at ${url%/webapi/entry.cgi}, $(nproc) cores; $events events in the log (log_fill)"
 

@@ -19,7 +19,8 @@ namespace kova_host {
 using Clock = std::chrono::steady_clock;
 // No deadline at all.
 inline constexpr Clock::time_point kNoDeadline = Clock::time_point::max();
-// The largest frame either side accepts: a handler's whole output fits.
+// The largest frame either side accepts: an answer's JSON envelope fits; a
+// handler's raw output over 64 KiB travels as a file instead.
 inline constexpr size_t kMaxFrame = size_t{256} << 20;
 
 enum class IoResult {

@@ -44,7 +44,9 @@ start_host() {
   "$build/host/kova-webapid" "${args[@]}" "${options[@]}" 2>"$root/host.log" &
   host=$!
   for _ in $(seq 100); do
-    port=$(sed -n 's|.*listening on http://127.0.0.1:\([0-9]*\)/.*|\1|p' "$root/host.log")
+    # The host's log appears once the host has started.
+    port=$(sed -n 's|.*listening on http://127.0.0.1:\([0-9]*\)/.*|\1|p' "$root/host.log" 2>/dev/null ||
+      true)
     [ -z "$port" ] || break
     sleep 0.1
   done

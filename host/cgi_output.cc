@@ -1,7 +1,10 @@
 #include "host/cgi_output.h"
 
 #include <strings.h>
+#include <unistd.h>
 
+#include <algorithm>
+#include <cerrno>
 #include <cstring>
 
 namespace kova_host {
@@ -29,9 +32,9 @@ bool Is(std::string_view name, const char* wanted) {
   return name.size() == strlen(wanted) && strncasecmp(name.data(), wanted, name.size()) == 0;
 }
 
-}  // namespace
-
-bool ParseCgiOutput(std::string_view output, CgiReply& reply, std::string& error) {
+// Parses the headers at the start of `output`; `body_start` is where the body
+// begins.
+bool ParseHead(std::string_view output, CgiReply& reply, size_t& body_start, std::string& error) {
   reply = CgiReply();
   size_t lines = 0;
   for (size_t start = 0;;) {
@@ -44,7 +47,7 @@ bool ParseCgiOutput(std::string_view output, CgiReply& reply, std::string& error
     if (!line.empty() && line.back() == '\r') line.remove_suffix(1);
     start = end + 1;
     if (line.empty()) {
-      reply.body = std::string(output.substr(start));
+      body_start = start;
       return true;
     }
     const size_t colon = line.find(':');
@@ -69,6 +72,38 @@ bool ParseCgiOutput(std::string_view output, CgiReply& reply, std::string& error
       reply.headers.emplace_back(name, value);
     }
   }
+}
+
+}  // namespace
+
+bool ParseCgiOutput(std::string_view output, CgiReply& reply, std::string& error) {
+  size_t body_start = 0;
+  if (!ParseHead(output, reply, body_start, error)) return false;
+  reply.body = std::string(output.substr(body_start));
+  return true;
+}
+
+bool ReadCgiHead(int fd, uint64_t size, CgiReply& reply, uint64_t& body_start, std::string& error) {
+  std::string head(static_cast<size_t>(std::min<uint64_t>(size, kMaxCgiHead)), '\0');
+  size_t done = 0;
+  while (done < head.size()) {
+    const ssize_t got = pread(fd, head.data() + done, head.size() - done, off_t(done));
+    if (got <= 0) {
+      error = got == 0 ? "the output's file is shorter than said"
+                       : std::string("cannot read the output: ") + strerror(errno);
+      return false;
+    }
+    done += static_cast<size_t>(got);
+  }
+  size_t start = 0;
+  if (!ParseHead(head, reply, start, error)) {
+    if (head.size() == kMaxCgiHead && error.find("no empty line") != std::string::npos) {
+      error = "the output's headers run past " + std::to_string(kMaxCgiHead >> 10) + " KiB";
+    }
+    return false;
+  }
+  body_start = start;
+  return true;
 }
 
 }  // namespace kova_host

@@ -1,6 +1,10 @@
 #include "host/cgi_output.h"
 
 #include <gtest/gtest.h>
+#include <sys/mman.h>
+#include <unistd.h>
+
+#include "host/unique_fd.h"
 
 namespace kova_host {
 namespace {
@@ -52,6 +56,40 @@ TEST(CgiOutputTest, RefusesMalformedOutput) {
     std::string error;
     EXPECT_FALSE(ParseCgiOutput(output, reply, error)) << output;
     EXPECT_FALSE(error.empty()) << output;
+  }
+}
+
+TEST(CgiOutputTest, ReadsOnlyTheHeadersOfOutputInAFile) {
+  const std::string big_body =
+      "Content-Type: text/csv\r\nX-A: 1\r\n\r\n" + std::string(200000, 'x');
+  const std::string long_head = "X-Long: " + std::string(kMaxCgiHead, 'a') + "\r\n\r\nbody";
+  const std::string short_head = "X-Long: " + std::string(kMaxCgiHead - 20, 'a') + "\r\n\r\nbody";
+  const struct {
+    const char* what;
+    std::string output;
+    uint64_t size;        // as the runner says it
+    uint64_t body_start;  // 0: refused
+    const char* error;
+  } cases[] = {
+      {"a large body", big_body, big_body.size(), 34, ""},
+      {"headers that end just within the limit", short_head, short_head.size(),
+       short_head.size() - 4, ""},
+      {"headers past the limit", long_head, long_head.size(), 0, "headers run past 64 KiB"},
+      {"a file shorter than said", "X-A: 1\n\nab", 100, 0, "shorter than said"},
+      {"a malformed header", "Status: 2000\n\n" + std::string(100000, 'x'), 100013, 0,
+       "status is malformed"},
+  };
+  for (const auto& c : cases) {
+    UniqueFd file(memfd_create("cgi", MFD_CLOEXEC));
+    ASSERT_EQ(write(file.get(), c.output.data(), c.output.size()), ssize_t(c.output.size()));
+    CgiReply reply;
+    uint64_t body_start = 0;
+    std::string error;
+    EXPECT_EQ(ReadCgiHead(file.get(), c.size, reply, body_start, error), c.body_start != 0)
+        << c.what;
+    EXPECT_EQ(body_start, c.body_start) << c.what;
+    EXPECT_NE(error.find(c.error), std::string::npos) << c.what << ": " << error;
+    EXPECT_TRUE(reply.body.empty()) << c.what;
   }
 }
 

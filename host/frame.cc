@@ -7,6 +7,7 @@
 
 #include <algorithm>
 #include <cstdint>
+#include <cstring>
 
 namespace kova_host {
 namespace {
@@ -28,13 +29,29 @@ IoResult Wait(int fd, short events, Clock::time_point deadline) {
   }
 }
 
-// Sends the buffers of `parts` in order, resuming after partial sends.
-IoResult WriteAll(int fd, iovec* parts, size_t count, Clock::time_point deadline) {
+// Descriptors one read takes at most; more are closed by the kernel.
+constexpr size_t kMaxReceived = 4;
+
+// Sends the buffers of `parts` in order, resuming after partial sends;
+// `attached`, unless -1, goes with the first byte.
+IoResult WriteAll(int fd, iovec* parts, size_t count, Clock::time_point deadline,
+                  int attached = -1) {
+  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
   while (count > 0) {
     msghdr message{};
     message.msg_iov = parts;
     message.msg_iovlen = count;
+    if (attached >= 0) {
+      message.msg_control = control;
+      message.msg_controllen = sizeof(control);
+      cmsghdr* header = CMSG_FIRSTHDR(&message);
+      header->cmsg_level = SOL_SOCKET;
+      header->cmsg_type = SCM_RIGHTS;
+      header->cmsg_len = CMSG_LEN(sizeof(int));
+      memcpy(CMSG_DATA(header), &attached, sizeof(int));
+    }
     ssize_t sent = sendmsg(fd, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
+    if (sent > 0) attached = -1;  // it went with the bytes sent
     if (sent < 0) {
       if (errno == EPIPE || errno == ECONNRESET) return IoResult::kClosed;
       if (errno != EAGAIN && errno != EINTR) return IoResult::kError;
@@ -64,12 +81,12 @@ iovec Part(const void* data, size_t size) { return {const_cast<void*>(data), siz
 
 }  // namespace
 
-IoResult WriteFrame(int fd, std::string_view payload, Clock::time_point deadline) {
+IoResult WriteFrame(int fd, std::string_view payload, Clock::time_point deadline, int attached) {
   if (payload.size() > kMaxFrame) return IoResult::kTooLarge;
   unsigned char prefix[4];
   Prefix(payload, prefix);
   iovec parts[] = {Part(prefix, 4), Part(payload.data(), payload.size())};
-  return WriteAll(fd, parts, 2, deadline);
+  return WriteAll(fd, parts, 2, deadline, attached);
 }
 
 IoResult WriteFrames(int fd, std::string_view first, std::string_view second,
@@ -97,8 +114,16 @@ IoResult FrameReader::Fill(size_t size, Clock::time_point deadline) {
     // The buffer only grows here, so each byte of it is cleared once.
     const size_t room = std::max(start_ + size, end_ + kReadSize);
     if (buffer_.size() < room) buffer_.resize(room);
-    const ssize_t got = recv(fd_, buffer_.data() + end_, buffer_.size() - end_,
-                             deadline == kNoDeadline ? 0 : MSG_DONTWAIT);
+    iovec room_left{buffer_.data() + end_, buffer_.size() - end_};
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * kMaxReceived)];
+    msghdr message{};
+    message.msg_iov = &room_left;
+    message.msg_iovlen = 1;
+    message.msg_control = control;
+    message.msg_controllen = sizeof(control);
+    const ssize_t got =
+        recvmsg(fd_, &message, MSG_CMSG_CLOEXEC | (deadline == kNoDeadline ? 0 : MSG_DONTWAIT));
+    if (got >= 0) Keep(message);
     if (got > 0) {
       end_ += static_cast<size_t>(got);
       continue;
@@ -107,6 +132,26 @@ IoResult FrameReader::Fill(size_t size, Clock::time_point deadline) {
     if (errno != EAGAIN && errno != EINTR) return IoResult::kError;
   }
   return IoResult::kOk;
+}
+
+void FrameReader::Keep(msghdr& message) {
+  for (cmsghdr* header = CMSG_FIRSTHDR(&message); header != nullptr;
+       header = CMSG_NXTHDR(&message, header)) {
+    if (header->cmsg_level != SOL_SOCKET || header->cmsg_type != SCM_RIGHTS) continue;
+    const size_t count = (header->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+    for (size_t i = 0; i < count; ++i) {
+      int passed;
+      memcpy(&passed, CMSG_DATA(header) + i * sizeof(int), sizeof(int));
+      descriptors_.emplace_back(passed);
+    }
+  }
+}
+
+UniqueFd FrameReader::TakeDescriptor() {
+  if (descriptors_.empty()) return UniqueFd();
+  UniqueFd first = std::move(descriptors_.front());
+  descriptors_.pop_front();
+  return first;
 }
 
 IoResult FrameReader::Read(std::string& payload, size_t max_size, Clock::time_point deadline) {

@@ -38,8 +38,12 @@ EntryRequest ToEntry(HttpRequest request) {
 }
 
 HttpReply ToHttp(EntryReply reply) {
-  return {reply.status, std::move(reply.content_type), std::move(reply.body),
-          std::move(reply.headers), std::move(reply.access)};
+  return {reply.status,
+          std::move(reply.content_type),
+          std::move(reply.body),
+          std::move(reply.headers),
+          std::move(reply.access),
+          std::move(reply.file)};
 }
 
 // The answers the server gives itself carry the envelope too: 102 for a path
@@ -86,6 +90,7 @@ int RunFrontEnd(int control, const Options& options, const Identity* account) {
   limits.header_timeout = options.header_timeout;
   limits.body_timeout = options.body_timeout;
   limits.keepalive_timeout = options.keepalive_timeout;
+  limits.send_timeout = options.send_timeout;
   limits.max_body = kMaxBody;
   // Declared first: calls still under way when it stops post their answers
   // to it, so it goes last.

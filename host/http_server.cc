@@ -1,7 +1,9 @@
 #include "host/http_server.h"
 
 #include <strings.h>
+#include <unistd.h>
 
+#include <algorithm>
 #include <boost/asio/dispatch.hpp>
 #include <boost/asio/executor_work_guard.hpp>
 #include <boost/asio/io_context.hpp>
@@ -13,6 +15,9 @@
 #include <boost/beast/core/flat_buffer.hpp>
 #include <boost/beast/core/string.hpp>
 #include <boost/beast/http.hpp>
+#include <cerrno>
+#include <cstring>
+#include <memory>
 #include <mutex>
 #include <optional>
 #include <thread>
@@ -308,21 +313,62 @@ class Connection : public std::enable_shared_from_this<Connection> {
     for (const auto& [name, value] : reply.headers) {
       if (Safe(name) && Safe(value)) response_.insert(name, value);
     }
-    response_.body() = std::move(reply.body);
     response_.keep_alive(keep);
-    response_.prepare_payload();
-    if (method_ == "HEAD") response_.body().clear();  // Content-Length stays the GET's
     status_ = reply.status;
     access_ = std::move(reply.access);
-    Deadline(server_.limits.keepalive_timeout);
+    Deadline(server_.limits.send_timeout);
+    if (reply.file.fd.valid()) {
+      file_ = std::move(reply.file);
+      response_.content_length(file_.length);
+      if (method_ == "HEAD") file_.length = 0;  // Content-Length stays the GET's
+      head_writer_.emplace(response_);
+      http::async_write_header(socket_, *head_writer_,
+                               [self = shared_from_this(), keep](const error_code& ec, size_t) {
+                                 if (ec) return self->OnWritten(ec, keep);
+                                 self->SendFilePart(keep);
+                               });
+      return;
+    }
+    response_.body() = std::move(reply.body);
+    response_.prepare_payload();
+    if (method_ == "HEAD") response_.body().clear();  // Content-Length stays the GET's
     http::async_write(socket_, response_,
                       [self = shared_from_this(), keep](const error_code& ec, size_t) {
                         self->OnWritten(ec, keep);
                       });
   }
 
+  // Reads the next part of the file's body and sends it, the next once it is
+  // sent; ends the answer after the last. A file that ends early cuts the
+  // connection, since its length was promised.
+  void SendFilePart(bool keep) {
+    if (file_.length == 0) return OnWritten({}, keep);
+    if (!part_) part_ = std::make_unique<char[]>(kFilePart);
+    const size_t want = static_cast<size_t>(std::min<uint64_t>(file_.length, kFilePart));
+    ssize_t got;
+    do {
+      got = pread(file_.fd.get(), part_.get(), want, static_cast<off_t>(file_.offset));
+    } while (got < 0 && errno == EINTR);
+    if (got <= 0) {
+      const int fault = got == 0 ? EIO : errno;
+      HostLog("http: cannot read an answer's body from its file: %s", strerror(fault));
+      return OnWritten(error_code(fault, boost::system::system_category()), keep);
+    }
+    file_.offset += static_cast<uint64_t>(got);
+    file_.length -= static_cast<uint64_t>(got);
+    Deadline(server_.limits.send_timeout);
+    net::async_write(socket_, net::buffer(part_.get(), static_cast<size_t>(got)),
+                     [self = shared_from_this(), keep](const error_code& ec, size_t) {
+                       if (ec) return self->OnWritten(ec, keep);
+                       self->SendFilePart(keep);
+                     });
+  }
+
   void OnWritten(const error_code& ec, bool keep) {
     LogAccess(remote_, method_, path_, status_, access_, Clock::now() - started_);
+    head_writer_.reset();
+    file_ = FileBody();
+    part_.reset();
     response_ = {};
     method_.clear();
     path_.clear();
@@ -363,6 +409,11 @@ class Connection : public std::enable_shared_from_this<Connection> {
   boost::beast::flat_buffer buffer_;
   std::optional<http::request_parser<http::string_body>> parser_;
   http::response<http::string_body> response_;
+  // An answer whose body comes from a file: its header's writer, the file, and
+  // the part being sent.
+  std::optional<http::response_serializer<http::string_body>> head_writer_;
+  FileBody file_;
+  std::unique_ptr<char[]> part_;
 
   // The request being served.
   unsigned version_ = 11;

@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "host/access_log.h"
+#include "host/unique_fd.h"
 
 namespace kova_host {
 
@@ -32,12 +33,21 @@ struct HttpRequest {
   std::string Header(std::string_view name) const;
 };
 
+// A body sent from a file part by part as it is read: `length` bytes from
+// `offset`. The server closes the file once the answer is sent or given up.
+struct FileBody {
+  UniqueFd fd;
+  uint64_t offset = 0;
+  uint64_t length = 0;
+};
+
 struct HttpReply {
   int status = 200;
   std::string content_type;
   std::string body;
   HttpHeaders headers;
   AccessRecord access;  // what the access log tells of the request
+  FileBody file{};      // when it holds a file: the body instead of `body`
 };
 
 // Receives the reply to a request, once, on any thread.
@@ -46,6 +56,10 @@ using HttpHandler = std::function<void(HttpRequest request, HttpDone done)>;
 // The reply for an error the server answers itself: a status and its reason.
 using HttpErrorReply = std::function<HttpReply(int status, const std::string& reason)>;
 
+// A body sent from a file goes out in parts of this size, each read when the
+// one before was sent: a download holds no more than this in memory.
+inline constexpr size_t kFilePart = 256 * 1024;
+
 struct HttpLimits {
   size_t max_connections = 10000;
   size_t max_per_address = 256;  // connections from one client address
@@ -53,9 +67,11 @@ struct HttpLimits {
   // connection: from its first byte) to the end of its header.
   std::chrono::steady_clock::duration header_timeout = std::chrono::seconds(10);
   std::chrono::steady_clock::duration body_timeout = std::chrono::seconds(30);
-  // Between requests on a kept-alive connection; also the time a client has to
-  // take an answer.
+  // Between requests on a kept-alive connection.
   std::chrono::steady_clock::duration keepalive_timeout = std::chrono::seconds(60);
+  // For the client to take an answer: a whole answer held in memory, or each
+  // part (kFilePart bytes) of a body sent from a file.
+  std::chrono::steady_clock::duration send_timeout = std::chrono::seconds(60);
   size_t max_body = size_t{1} << 20;
   size_t max_target = 8192;   // longer: 414
   size_t max_header = 16384;  // request line and header fields; longer: 431

@@ -24,7 +24,8 @@ const char kUsage[] =
     "  --header-timeout SECONDS  to send a request's line and header (10)\n"
     "  --body-timeout SECONDS    to send a request's body (30)\n"
     "  --keepalive-timeout SECONDS\n"
-    "                            a connection idle between requests is closed (60)\n";
+    "                            a connection idle between requests is closed (60)\n"
+    "  --send-timeout SECONDS    to take an answer, or each 256 KiB of a download (60)\n";
 
 namespace {
 
@@ -62,6 +63,8 @@ const OptionRow kOptions[] = {
      [](Options& o, const std::string&, long n) { o.body_timeout = std::chrono::seconds(n); }},
     {"--keepalive-timeout", true, 1, 3600,
      [](Options& o, const std::string&, long n) { o.keepalive_timeout = std::chrono::seconds(n); }},
+    {"--send-timeout", true, 1, 3600,
+     [](Options& o, const std::string&, long n) { o.send_timeout = std::chrono::seconds(n); }},
     {nullptr, false, 0, 0, nullptr},
 };
 

@@ -24,6 +24,7 @@ struct Options {
   std::chrono::seconds header_timeout{10};     // to read a request's line and header
   std::chrono::seconds body_timeout{30};       // to read its body
   std::chrono::seconds keepalive_timeout{60};  // a connection idle between requests
+  std::chrono::seconds send_timeout{60};       // for a client to take an answer, or each part
 };
 
 extern const char kUsage[];

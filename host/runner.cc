@@ -18,13 +18,20 @@
 #include "host/json_text.h"
 #include "host/module_loader.h"
 #include "host/taken_count.h"
+#include "host/unique_fd.h"
 #include "kova/webapi.h"
 
 namespace kova_host {
 namespace {
 
+// Output up to this size is copied through the socket; larger output is handed
+// over as the file that holds it.
+constexpr off_t kInlineOutput = 64 * 1024;
+
 // How much the last call wrote, -1 before the first.
 off_t last_output = -1;
+// Where standard output's files are made: the system's temporary folder.
+std::string output_dir = "/tmp";
 
 void ResetOutput() {
   fflush(stdout);
@@ -34,23 +41,50 @@ void ResetOutput() {
   }
 }
 
-// What the call wrote to standard output. False when it is too large to hand over.
-bool TakeOutput(std::string& output) {
-  fflush(stdout);
-  const off_t size = lseek(STDOUT_FILENO, 0, SEEK_END);
-  last_output = size;
-  output.clear();
-  if (size <= 0) return true;
-  if (static_cast<size_t>(size) > kMaxFrame) return false;
-  output.resize(static_cast<size_t>(size));
-  size_t done = 0;
-  while (done < output.size()) {
-    const ssize_t got =
-        pread(STDOUT_FILENO, output.data() + done, output.size() - done, static_cast<off_t>(done));
-    if (got <= 0) break;
-    done += static_cast<size_t>(got);
+// A fresh, empty file without a name for standard output: O_TMPFILE in the
+// temporary folder, else a file made there and unlinked at once, else a memory
+// file. -1 when none can be made.
+int NewOutputFile() {
+  int fd = open(output_dir.c_str(), O_TMPFILE | O_RDWR | O_CLOEXEC, 0600);
+  if (fd >= 0) return fd;
+  std::string name = output_dir + "/kova-webapid-output.XXXXXX";
+  fd = mkostemp(name.data(), O_CLOEXEC);
+  if (fd >= 0) {
+    unlink(name.c_str());
+    return fd;
   }
-  output.resize(done);
+  return memfd_create("kova-webapid-output", MFD_CLOEXEC);
+}
+
+// How much the call wrote to standard output, -1 when that can't be told.
+off_t OutputSize() {
+  fflush(stdout);
+  last_output = lseek(STDOUT_FILENO, 0, SEEK_END);
+  return last_output;
+}
+
+// The first `size` bytes of standard output into `answer`: copied when small,
+// else the file itself, standard output going on in a fresh file. False when
+// the output can't be handed over.
+bool TakeOutput(off_t size, RunnerAnswer& answer) {
+  if (size < 0) return false;
+  if (size <= kInlineOutput) {
+    answer.body.resize(static_cast<size_t>(size));
+    size_t done = 0;
+    while (done < answer.body.size()) {
+      const ssize_t got = pread(STDOUT_FILENO, answer.body.data() + done, answer.body.size() - done,
+                                static_cast<off_t>(done));
+      if (got <= 0) return false;
+      done += static_cast<size_t>(got);
+    }
+    return true;
+  }
+  UniqueFd next(NewOutputFile());
+  UniqueFd taken(fcntl(STDOUT_FILENO, F_DUPFD_CLOEXEC, 0));
+  if (!next.valid() || !taken.valid() || dup2(next.get(), STDOUT_FILENO) < 0) return false;
+  last_output = 0;
+  answer.output = std::move(taken);
+  answer.output_size = static_cast<uint64_t>(size);
   return true;
 }
 
@@ -86,14 +120,18 @@ RunnerAnswer ExecuteCall(const RunnerCall& call) {
     HostLog("runner: %s raised an exception", Name(call).c_str());
     failure = "the handler raised an exception";
   }
-  std::string output;
-  if (!TakeOutput(output)) failure = "the handler's output is too large";
+  const off_t output_size = OutputSize();
   if (failure != nullptr) return Error(KOVA::kAPIErrorUnknown, Reason(failure));
   if (refused != 0) return Error(refused, Json::Value());
-  if (!response.IsOutputEnabled()) return {true, 0, std::move(output)};
-  if (!output.empty()) {
-    HostLog("runner: %s wrote %zu bytes to standard output with the envelope on; dropped",
-            Name(call).c_str(), output.size());
+  if (!response.IsOutputEnabled()) {
+    RunnerAnswer answer{true, 0, ""};
+    if (TakeOutput(output_size, answer)) return answer;
+    HostLog("runner: %s: cannot hand its output over: %s", Name(call).c_str(), strerror(errno));
+    return Error(KOVA::kAPIErrorUnknown, Reason("the handler's output cannot be read"));
+  }
+  if (output_size > 0) {
+    HostLog("runner: %s wrote %lld bytes to standard output with the envelope on; dropped",
+            Name(call).c_str(), static_cast<long long>(output_size));
   }
   if (response.GetSettleCount() > 1) {
     HostLog("runner: %s settled its answer %d times; the last one counts", Name(call).c_str(),
@@ -129,8 +167,9 @@ bool MountPrivateTmp(const std::string& folder, const std::string& tmp, std::str
 int RunRunner(int fd, const RunnerSetup& setup) {
   const pid_t parent = getppid();
   signal(SIGINT, SIG_IGN);  // the monitor stops the runner
+  output_dir = setup.tmp_dir;
   const int null = open("/dev/null", O_RDONLY | O_CLOEXEC);
-  const int output = memfd_create("kova-webapid-output", MFD_CLOEXEC);
+  const int output = NewOutputFile();
   if (null < 0 || output < 0 || dup2(null, STDIN_FILENO) < 0 || dup2(output, STDOUT_FILENO) < 0) {
     HostLog("runner: cannot set up standard input and output");
     return 1;

@@ -66,8 +66,13 @@ IoResult ReceiveCall(FrameReader& reader, RunnerCall& call) {
 
 IoResult SendAnswer(int fd, const RunnerAnswer& answer) {
   Json::Value header;
-  header["kind"] = answer.raw ? "raw" : "json";
   header["code"] = answer.code;
+  if (answer.output.valid()) {
+    header["kind"] = "file";
+    header["size"] = Json::UInt64(answer.output_size);
+    return WriteFrame(fd, ToJson(header), kNoDeadline, answer.output.get());
+  }
+  header["kind"] = answer.raw ? "raw" : "json";
   return WriteFrames(fd, ToJson(header), answer.body, kNoDeadline);
 }
 
@@ -76,10 +81,17 @@ IoResult ReceiveAnswer(FrameReader& reader, RunnerAnswer& answer, Clock::time_po
   const IoResult got = ReadJson(reader, header, deadline);
   if (got != IoResult::kOk) return got;
   const Json::Value& kind = header["kind"];
-  if ((kind != "raw" && kind != "json") || !header["code"].isInt()) return IoResult::kError;
-  answer.raw = kind == "raw";
+  if ((kind != "raw" && kind != "json" && kind != "file") || !header["code"].isInt()) {
+    return IoResult::kError;
+  }
+  answer.raw = kind != "json";
   answer.code = header["code"].asInt();
-  return reader.Read(answer.body, kMaxFrame, deadline);
+  if (kind != "file") return reader.Read(answer.body, kMaxFrame, deadline);
+  // The file came with the header's first byte.
+  answer.output = reader.TakeDescriptor();
+  if (!answer.output.valid() || !header["size"].isUInt64()) return IoResult::kError;
+  answer.output_size = header["size"].asUInt64();
+  return IoResult::kOk;
 }
 
 }  // namespace kova_host

@@ -4,16 +4,22 @@
 //   front-end, a call:     {"api", "version", "method", "params", "user", "language"}
 //   runner, the answer:    {"kind": "json" | "raw", "code": CODE}, then one more frame:
 //                          the answer's envelope as JSON text ("json"), or everything
-//                          the handler wrote to standard output ("raw").
+//                          the handler wrote to standard output ("raw");
+//                          or, for output too large to copy through the socket,
+//                          {"kind": "file", "code": 0, "size": BYTES} alone, with the
+//                          file that holds the output attached (SCM_RIGHTS): the
+//                          front-end owns it from then on.
 
 #ifndef KOVA_HOST_RUNNER_PROTOCOL_H_
 #define KOVA_HOST_RUNNER_PROTOCOL_H_
 
 #include <json/value.h>
 
+#include <cstdint>
 #include <string>
 
 #include "host/frame.h"
+#include "host/unique_fd.h"
 
 namespace kova_host {
 
@@ -29,7 +35,10 @@ struct RunnerCall {
 struct RunnerAnswer {
   bool raw = false;  // the handler turned the envelope off
   int code = 0;      // the envelope's error code, 0 on success and for raw output
-  std::string body;  // the envelope's JSON text, or the raw output
+  std::string body;  // the envelope's JSON text, or the raw output sent inline
+  // Raw output handed over as a file instead: its first `output_size` bytes.
+  UniqueFd output{};
+  uint64_t output_size = 0;
 };
 
 IoResult SendReady(int fd, const Json::Value& methods);

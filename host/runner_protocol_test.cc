@@ -1,7 +1,9 @@
 #include "host/runner_protocol.h"
 
 #include <gtest/gtest.h>
+#include <sys/mman.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <thread>
@@ -48,6 +50,38 @@ TEST_F(RunnerProtocolTest, CallsAndAnswersCrossWhole) {
   writer.join();
   EXPECT_TRUE(answer.raw);
   EXPECT_EQ(answer.body, output);
+}
+
+TEST_F(RunnerProtocolTest, OutputInAFileIsHandedOverWithItsDescriptor) {
+  const std::string output = "Content-Type: text/csv\r\n\r\nTime,Level\r\n";
+  RunnerAnswer sent{true, 0, ""};
+  sent.output = UniqueFd(memfd_create("output", MFD_CLOEXEC));
+  ASSERT_EQ(write(sent.output.get(), output.data(), output.size()), ssize_t(output.size()));
+  sent.output_size = output.size() - 2;  // what the runner says counts
+  // A second answer right behind the first: both may come with one read.
+  ASSERT_EQ(SendAnswer(fds_[1], sent), IoResult::kOk);
+  ASSERT_EQ(SendAnswer(fds_[1], {false, 0, "{}"}), IoResult::kOk);
+  const auto deadline = Clock::now() + std::chrono::seconds(10);
+  RunnerAnswer file, json;
+  ASSERT_EQ(ReceiveAnswer(reader_[0], file, deadline), IoResult::kOk);
+  ASSERT_EQ(ReceiveAnswer(reader_[0], json, deadline), IoResult::kOk);
+  EXPECT_TRUE(file.raw);
+  EXPECT_EQ(file.output_size, output.size() - 2);
+  ASSERT_TRUE(file.output.valid());
+  struct stat ours {
+  }, theirs{};
+  ASSERT_EQ(fstat(sent.output.get(), &ours), 0);
+  ASSERT_EQ(fstat(file.output.get(), &theirs), 0);
+  EXPECT_EQ(ours.st_ino, theirs.st_ino);  // the same file, not a copy
+  EXPECT_FALSE(json.raw);
+  EXPECT_FALSE(json.output.valid());
+  EXPECT_EQ(json.body, "{}");
+
+  // A file answer that came without its descriptor breaks the protocol.
+  ASSERT_EQ(WriteFrame(fds_[1], R"({"kind": "file", "code": 0, "size": 5})", kNoDeadline),
+            IoResult::kOk);
+  EXPECT_EQ(ReceiveAnswer(reader_[0], file, deadline), IoResult::kError);
+  EXPECT_FALSE(file.output.valid());
 }
 
 TEST_F(RunnerProtocolTest, ReportsTimeoutsClosedPeersAndMalformedFrames) {

@@ -350,15 +350,26 @@ EntryReply WebEntry::ModuleReply(const Call& call, CallResult result, RunnerAnsw
     reply.headers.emplace_back("Cache-Control", "no-store");
     return reply;
   }
+  // Output that came in a file is read for its headers only; the body is sent
+  // from the file.
   CgiReply cgi;
   std::string fault;
-  if (!ParseCgiOutput(answer.body, cgi, fault)) {
+  uint64_t body_start = 0;
+  const bool in_file = answer.output.valid();
+  const bool parsed =
+      in_file ? ReadCgiHead(answer.output.get(), answer.output_size, cgi, body_start, fault)
+              : ParseCgiOutput(answer.body, cgi, fault);
+  if (!parsed) {
     HostLog("%s v%d %s: %s", call.api.c_str(), call.version, call.method.c_str(), fault.c_str());
     return Error(KOVA::kAPIErrorUnknown, "the handler's output is malformed");
   }
   reply.status = cgi.status;
   reply.content_type = cgi.content_type;
-  reply.body = std::move(cgi.body);
+  if (in_file) {
+    reply.file = {std::move(answer.output), body_start, answer.output_size - body_start};
+  } else {
+    reply.body = std::move(cgi.body);
+  }
   for (auto& header : cgi.headers) reply.headers.push_back(std::move(header));
   return reply;
 }

@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "host/access_log.h"
+#include "host/http_server.h"
 #include "host/params.h"
 #include "host/runner_pool.h"
 #include "host/sessions.h"
@@ -43,6 +44,7 @@ struct EntryReply {
   std::string body;
   std::vector<std::pair<std::string, std::string>> headers;
   AccessRecord access;  // what the access log tells of the call
+  FileBody file;        // a module's large raw output: the body instead of `body`
 };
 
 // Receives the reply to a request.

@@ -18,10 +18,12 @@
 #include <mutex>
 #include <optional>
 #include <regex>
+#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
 
+#include "host/testdata/pattern.h"
 #include "test_support/daemon_service.h"
 #include "test_support/host_call.h"
 #include "test_support/raw_http.h"
@@ -377,6 +379,146 @@ TEST_F(WebApidTest, AModuleThatCrashesOrHangsDoesNotTakeTheHostDown) {
             "ger");
   EXPECT_EQ(Call("KOVA.Test.Crash", "echo", {{"value", "csv"}}, sid).json["data"]["value"], "csv");
   EXPECT_THAT(host_->Log(), HasSubstr("killed by signal 6"));
+}
+
+// The number of descriptors process `pid` holds open.
+size_t OpenDescriptors(pid_t pid) {
+  std::error_code error;
+  size_t count = 0;
+  for (std::filesystem::directory_iterator it("/proc/" + std::to_string(pid) + "/fd", error), end;
+       !error && it != end; it.increment(error)) {
+    ++count;
+  }
+  return count;
+}
+
+// The descriptors `pid` holds once they are `want` again, or after `wait`.
+size_t SettledDescriptors(pid_t pid, size_t want,
+                          std::chrono::milliseconds wait = std::chrono::seconds(5)) {
+  const auto deadline = std::chrono::steady_clock::now() + wait;
+  size_t count = OpenDescriptors(pid);
+  while (count != want && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    count = OpenDescriptors(pid);
+  }
+  return count;
+}
+
+// The front-end: the monitor's child started first, before any runner.
+pid_t FrontEnd(pid_t monitor) {
+  std::pair<unsigned long long, pid_t> first{~0ULL, -1};  // start time, pid
+  for (const auto& entry : std::filesystem::directory_iterator("/proc")) {
+    const std::string name = entry.path().filename().string();
+    if (name.find_first_not_of("0123456789") != std::string::npos) continue;
+    std::ifstream in(entry.path() / "stat");
+    const std::string stat(std::istreambuf_iterator<char>(in), {});
+    const size_t end = stat.rfind(')');
+    if (end == std::string::npos) continue;
+    // Past the name: state (field 3), parent (4), ..., start time (22).
+    std::istringstream fields(stat.substr(end + 1));
+    std::string field;
+    long parent = 0;
+    unsigned long long start = 0;
+    fields >> field >> parent;
+    for (int i = 5; i < 22; ++i) fields >> field;
+    fields >> start;
+    if (parent == monitor) first = std::min(first, {start, static_cast<pid_t>(std::stoi(name))});
+  }
+  return first.second;
+}
+
+// Where `body` first differs from the test module's pattern; its size when nowhere.
+size_t FirstDifference(const std::string& body) {
+  for (size_t i = 0; i < body.size(); ++i) {
+    if (body[i] != kova_test::PatternByte(i)) return i;
+  }
+  return body.size();
+}
+
+std::string BigForm(uint64_t size, const std::string& sid) {
+  return Form({{"api", "KOVA.Test.Crash"},
+               {"version", "1"},
+               {"method", "big"},
+               {"size", std::to_string(size)},
+               {"_sid", sid}});
+}
+
+TEST_F(WebApidTest, RawOutputOfAnySizeArrivesWholeAndItsFileIsClosed) {
+  AddModule(KOVA_CRASH_MODULE_PATH);
+  Start();
+  const std::string sid = Sid("admin", kAdminPassword);
+  const Json::Value runner = Call("KOVA.Test.Crash", "echo", {}, sid).json["data"]["pid"];
+  ASSERT_TRUE(runner.isInt());
+  const pid_t front_end = FrontEnd(host_->pid());
+  ASSERT_GT(front_end, 0);
+  std::this_thread::sleep_for(std::chrono::milliseconds(300));  // the calls' connections close
+  const size_t front_fds = OpenDescriptors(front_end);
+  const size_t runner_fds = OpenDescriptors(runner.asInt());
+
+  // Either side of what travels inline (64 KiB with the headers), either side
+  // of one part sent from the file, and more than any buffer on the way.
+  for (const uint64_t size : {0, 65000, 70000, 262143, 262145, 20000000}) {
+    const Reply got = Send("GET", BigForm(size, sid), {});
+    EXPECT_EQ(got.status, 200) << size;
+    EXPECT_EQ(got.headers.find("Content-Type")->second, "application/octet-stream") << size;
+    EXPECT_EQ(got.headers.find("Content-Disposition")->second, "attachment; filename=\"big.bin\"");
+    EXPECT_EQ(got.headers.find("Content-Length")->second, std::to_string(size));
+    EXPECT_EQ(got.headers.find("X-Content-Type-Options")->second, "nosniff");
+    ASSERT_EQ(got.body.size(), size);
+    EXPECT_EQ(FirstDifference(got.body), size) << size;
+  }
+  httplib::Client client("127.0.0.1", host_->port());
+  const httplib::Result head =
+      client.Head(std::string("/webapi/entry.cgi?") + BigForm(300000, sid));
+  ASSERT_TRUE(head);
+  EXPECT_EQ(head->get_header_value("Content-Length"), "300000");
+  EXPECT_TRUE(head->body.empty());
+
+  EXPECT_EQ(SettledDescriptors(front_end, front_fds), front_fds);
+  EXPECT_EQ(OpenDescriptors(runner.asInt()), runner_fds);
+  EXPECT_EQ(Call("KOVA.Test.Crash", "echo", {}, sid).json["data"]["pid"], runner);
+}
+
+TEST_F(WebApidTest, ADownloadDroppedOrNoLongerTakenIsClosedAndOthersGoOn) {
+  AddModule(KOVA_CRASH_MODULE_PATH);
+  Start({"--send-timeout", "4"});
+  const std::string sid = Sid("admin", kAdminPassword);
+  const Json::Value runner = Call("KOVA.Test.Crash", "echo", {}, sid).json["data"]["pid"];
+  ASSERT_TRUE(runner.isInt());
+  const pid_t front_end = FrontEnd(host_->pid());
+  ASSERT_GT(front_end, 0);
+  std::this_thread::sleep_for(std::chrono::milliseconds(300));  // the calls' connections close
+  const size_t front_fds = OpenDescriptors(front_end);
+  const size_t runner_fds = OpenDescriptors(runner.asInt());
+  const std::string request =
+      "GET /webapi/entry.cgi?" + BigForm(20000000, sid) + " HTTP/1.1\r\nHost: x\r\n\r\n";
+  const struct {
+    const char* what;
+    bool drop;  // closes after the first megabyte, else takes nothing
+  } cases[] = {{"a client that goes away", true}, {"a client that stops taking", false}};
+  for (const auto& c : cases) {
+    auto client = std::make_unique<kova_test::RawConnection>(host_->port());
+    ASSERT_TRUE(client->Send(request));
+    // The download is under way: its socket and file are open.
+    EXPECT_GE(SettledDescriptors(front_end, front_fds + 2), front_fds + 2) << c.what;
+    if (c.drop) {
+      EXPECT_GE(client->ReadAtLeast(1 << 20, std::chrono::seconds(10)).size(), size_t{1} << 20);
+      client.reset();
+    }
+    // The runner is free while the client holds the download.
+    EXPECT_TRUE(Call("KOVA.Test.Crash", "echo", {}, sid).json["success"].asBool()) << c.what;
+    // One that went away is seen at once, before its send time would run out.
+    const auto start = std::chrono::steady_clock::now();
+    EXPECT_EQ(SettledDescriptors(front_end, front_fds, std::chrono::seconds(c.drop ? 3 : 15)),
+              front_fds)
+        << c.what;
+    if (!c.drop) {
+      EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::seconds(2)) << c.what;
+    }
+  }
+  EXPECT_EQ(OpenDescriptors(runner.asInt()), runner_fds);
+  const Reply again = Send("GET", BigForm(3000000, sid), {});
+  EXPECT_EQ(FirstDifference(again.body), 3000000u);
 }
 
 TEST_F(WebApidTest, ModulesRunApartAndAFullQueueIsRefusedUntilItDrains) {

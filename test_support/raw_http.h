@@ -81,6 +81,24 @@ class RawConnection {
     return recv(fd_, &byte, 1, MSG_PEEK | MSG_DONTWAIT) > 0;
   }
 
+  // At least `count` bytes of what the server sends, waiting up to `wait`;
+  // fewer when it closes or the time runs out.
+  std::string ReadAtLeast(size_t count, std::chrono::milliseconds wait) const {
+    const auto deadline = std::chrono::steady_clock::now() + wait;
+    std::string text;
+    while (text.size() < count) {
+      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+          deadline - std::chrono::steady_clock::now());
+      pollfd ready{fd_, POLLIN, 0};
+      if (left.count() <= 0 || poll(&ready, 1, static_cast<int>(left.count())) <= 0) break;
+      char buffer[65536];
+      const ssize_t got = recv(fd_, buffer, sizeof(buffer), 0);
+      if (got <= 0) break;
+      text.append(buffer, static_cast<size_t>(got));
+    }
+    return text;
+  }
+
   // One answer: its header and a body of its Content-Length, waiting up to
   // `wait`; what arrived, possibly cut short.
   std::string ReadAnswer(std::chrono::milliseconds wait) const {

@@ -91,6 +91,7 @@ class WebApid {
   WebApid& operator=(const WebApid&) = delete;
 
   int port() const { return port_; }
+  pid_t pid() const { return pid_; }  // the monitor's
   std::string Log() const {
     std::ifstream in(log_);
     return std::string(std::istreambuf_iterator<char>(in), {});

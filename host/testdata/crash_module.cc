@@ -1,12 +1,15 @@
 // A web-API module for the host's tests, "KOVA.Test.Crash": it aborts, hangs,
-// throws, leaves a temporary file or writes its own output when asked to.
+// throws, leaves a temporary file or writes its own output, small or large,
+// when asked to.
 
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <stdexcept>
 
+#include "host/testdata/pattern.h"
 #include "kova/conf.h"
 #include "kova/webapi.h"
 
@@ -38,6 +41,22 @@ void Raw(KOVA::APIRequest*, KOVA::APIResponse* response) {
   printf("Status: 202 Accepted\nContent-Type: text/plain\r\nX-Test: yes\r\n\r\nhello\n");
 }
 
+// A download of `size` bytes (20 MB unless given) of kova_test::PatternByte.
+void Big(KOVA::APIRequest* request, KOVA::APIResponse* response) {
+  response->SetEnableOutput(false);
+  const uint64_t size = request->GetParam("size", 20000000).asUInt64();
+  printf(
+      "Content-Type: application/octet-stream\r\n"
+      "Content-Disposition: attachment; filename=\"big.bin\"\r\n\r\n");
+  char part[65536];
+  for (uint64_t done = 0; done < size;) {
+    const size_t count = static_cast<size_t>(std::min<uint64_t>(sizeof(part), size - done));
+    for (size_t i = 0; i < count; ++i) part[i] = kova_test::PatternByte(done + i);
+    fwrite(part, 1, count, stdout);
+    done += count;
+  }
+}
+
 void Garbage(KOVA::APIRequest*, KOVA::APIResponse* response) {
   response->SetEnableOutput(false);
   printf("no headers here");
@@ -63,6 +82,7 @@ __attribute__((visibility("default"))) APITableEntry gTable[] = {
     {"KOVA.Test.Crash", 1, "sleep", Sleep},
     {"KOVA.Test.Crash", 1, "echo", Echo},
     {"KOVA.Test.Crash", 1, "raw", Raw},
+    {"KOVA.Test.Crash", 1, "big", Big},
     {"KOVA.Test.Crash", 1, "garbage", Garbage},
     {"KOVA.Test.Crash", 1, "throw", Throw},
     {"KOVA.Test.Crash", 1, "refused", Echo},

@@ -165,7 +165,7 @@ TEST(StatdMetrics, ARealScrapeHasTheMachinesAndTheSystemsSeriesAndPassesPromtool
   kova_test::TestRoot root;
   root.Write("/etc/kovainfo.conf", "statd_metrics_listen=\"127.0.0.1:0\"\n");
   // A running service and a package's, their records naming sleeping processes.
-  Program service({"sleep", "60"}, "", root.Path("/sleep1.log"));
+  Program service({"sh", "-c", "while :; do :; done"}, "", root.Path("/busy.log"));
   Program package({"sleep", "60"}, "", root.Path("/sleep2.log"));
   root.Write("/etc/kova/services/web.conf", "command=\"/bin/true\"\ndisplay_name=\"Web UI\"\n");
   root.Write("/var/packages/Media/INFO", "package=\"Media\"\ndisplayname=\"Media Server\"\n");
@@ -202,6 +202,11 @@ TEST(StatdMetrics, ARealScrapeHasTheMachinesAndTheSystemsSeriesAndPassesPromtool
       "1\n",
   };
   for (const char* line : wanted) EXPECT_NE(text.find(line), std::string::npos) << line;
+  // The busy service's CPU time counts up.
+  std::smatch cpu;
+  const std::regex counter("kova_service_cpu_seconds_total\\{[^}]*\\} ([0-9.e+]+)");
+  ASSERT_TRUE(std::regex_search(text, cpu, counter));
+  EXPECT_GT(std::stod(cpu[1]), 0.3);
 
   // promtool parses it and has nothing to say but that node_exporter's
   // node_memory_* names, kept as they are for its dashboards, are camelCase.

@@ -30,9 +30,9 @@ TEST(PerfStateTest, TakesItsLinesAndLeavesTheRest) {
        "firing\tr1\tMedia Server\tcpu\nfiring\tr2\tBackup LUN\tio_latency\n",
        {{3, 0, 12}, {{"r1", "Media Server", "cpu"}, {"r2", "Backup LUN", "io_latency"}}}},
       // Unknown kinds, other levels, bad counts, wrong field counts: left out.
-      {"version\t2\nevents_total\tDebug\t5\nevents_total\tInfo\t-1\nevents_total\tWarning\t7x\n"
-       "events_total\tCritical\t4\textra\nfiring\tr1\tsystem\nfiring\t\tsystem\tcpu\n"
-       "events_total\tWarning\t2",
+      {"version\t2\nevents_total\tDebug\t5\nevents_total\tInfo\t-1\nevents_total\tWarning\t2\n"
+       "events_total\tWarning\t7x\nevents_total\tCritical\t4\textra\nfiring\tr1\tsystem\n"
+       "firing\t\tsystem\tcpu",
        {{0, 2, 0}, {}}},
       {"", {}},
   };

@@ -179,7 +179,7 @@ int main(int argc, char** argv) {
   waitpid(exporter, nullptr, 0);
   if (!up) fprintf(stderr, "metrics_bench: prometheus-node-exporter did not answer\n");
   Print("node_exporter", their_count, theirs);
-  if (theirs.mean_ms > 0) {
+  if (theirs.mean_ms > 0 && ours.mean_ms > 0) {
     printf("ratio ours/node_exporter: time %.3f, size %.3f\n", ours.mean_ms / theirs.mean_ms,
            static_cast<double>(ours.bytes) / static_cast<double>(theirs.bytes));
   }

@@ -106,8 +106,9 @@ struct MountPoint {
   uint32_t major = 0;
   uint32_t minor = 0;
   std::string path;
-  std::string source;  // the mount source after " - ", such as /dev/sda1
-  std::string fstype;  // the file system's type, such as ext4
+  // Given defaults, so that a mount written as {major, minor, path} needs no more.
+  std::string source = {};  // the mount source after " - ", such as /dev/sda1
+  std::string fstype = {};  // the file system's type, such as ext4
 };
 
 // What a pass reads besides the "cpu" line of stat and MemTotal and

@@ -312,6 +312,7 @@ TEST(StatdMetrics, AFloodOfScrapesLeavesSamplingOnTime) {
     });
   }
   for (std::thread& client : clients) client.join();
+  RecordProperty("scrapes", scrapes.load());
   EXPECT_GT(scrapes.load(), 2000);
   EXPECT_EQ(failures.load(), 0);
 

@@ -201,6 +201,7 @@ int RunDaemon(const Options& options) {
       // Rendered once here; scrapes until the next sample get this text.
       MetricsSample sample = sampler->Metrics();
       sample.time = next;
+      sample.delay = clock.Now() - next;
       std::string read_error;
       sample.perf = ReadPerfState(kova::RootPath(kPerfStateFile), read_error);
       if (read_error != perf_error && !read_error.empty()) Log(LOG_WARNING, read_error);

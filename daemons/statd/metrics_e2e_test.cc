@@ -11,11 +11,13 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <cstdlib>
 #include <fstream>
 #include <memory>
+#include <mutex>
 #include <regex>
 #include <set>
 #include <sstream>
@@ -296,9 +298,12 @@ TEST(StatdMetrics, AFloodOfScrapesLeavesSamplingOnTime) {
   const int64_t first = start["data"]["now"].asInt64();
   ASSERT_GT(first, 0) << start;
 
-  // Four keep-alive clients scrape as fast as they can for 5 s.
+  // Four keep-alive clients scrape as fast as they can for 5 s, noting the
+  // longest delay of a sample's pass they see.
   std::atomic<int> scrapes{0};
   std::atomic<int> failures{0};
+  std::mutex mutex;
+  double longest_delay = 0;
   std::vector<std::thread> clients;
   const auto end = std::chrono::steady_clock::now() + std::chrono::seconds(5);
   for (int i = 0; i < 4; ++i) {
@@ -308,6 +313,12 @@ TEST(StatdMetrics, AFloodOfScrapesLeavesSamplingOnTime) {
       while (std::chrono::steady_clock::now() < end) {
         const httplib::Result result = client.Get("/metrics");
         ++(result && result->status == 200 ? scrapes : failures);
+        constexpr std::string_view kDelay = "\nkova_statd_sample_delay_seconds ";
+        const size_t at = result ? result->body.find(kDelay) : std::string::npos;
+        if (at == std::string::npos) continue;
+        const double delay = std::strtod(result->body.c_str() + at + kDelay.size(), nullptr);
+        std::lock_guard lock(mutex);
+        longest_delay = std::max(longest_delay, delay);
       }
     });
   }
@@ -315,6 +326,9 @@ TEST(StatdMetrics, AFloodOfScrapesLeavesSamplingOnTime) {
   RecordProperty("scrapes", scrapes.load());
   EXPECT_GT(scrapes.load(), 2000);
   EXPECT_EQ(failures.load(), 0);
+  RecordProperty("longest_delay_us", static_cast<int>(longest_delay * 1e6));
+  EXPECT_GT(longest_delay, 0);
+  EXPECT_LT(longest_delay, 0.3);
 
   // One sample each second all along.
   const Json::Value samples = kova_test::AskCollector(

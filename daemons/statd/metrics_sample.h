@@ -47,7 +47,8 @@ struct LunCounters {
 };
 
 struct MetricsSample {
-  double time = 0;  // the sample's Unix time
+  double time = 0;   // the sample's Unix time
+  double delay = 0;  // seconds from that time to the end of the sample's pass
   uint64_t ticks_per_second = 100;
   uint64_t boot_time = 0;                 // 0: unknown
   std::vector<sampling::CpuStates> cpus;  // each CPU's line, not the sum

@@ -330,6 +330,9 @@ std::string RenderMetrics(const MetricsSample& sample, MetricsFormat format) {
   }
   w.Family("node_time_seconds", "gauge", "System time in seconds since epoch (1970).");
   w.Sample({}, sample.time);
+  w.Family("kova_statd_sample_delay_seconds", "gauge",
+           "Seconds from the sample's planned time to the end of its pass.");
+  w.Sample({}, sample.delay);
   WriteCpus(sample, w);
   WriteLoadAndMemory(sample, w);
   WriteDevices(sample, w);

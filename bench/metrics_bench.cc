@@ -7,9 +7,7 @@
 //   metrics_bench [SCRAPES]   (default 2000 of ours, a tenth of that of theirs)
 
 #include <httplib.h>
-#include <netinet/in.h>
 #include <signal.h>
-#include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -23,6 +21,7 @@
 
 #include "statd/metrics_server.h"
 #include "statd/metrics_text.h"
+#include "test_support/free_port.h"
 
 namespace {
 
@@ -68,18 +67,6 @@ statd::MetricsSample BusyBox() {
                              {"r2", "LUN 1", "io_latency"},
                              {"r3", "system", "memory"}}};
   return s;
-}
-
-int FreePort() {
-  const int fd = socket(AF_INET, SOCK_STREAM, 0);
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t length = sizeof(address);
-  bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof(address));
-  getsockname(fd, reinterpret_cast<sockaddr*>(&address), &length);
-  close(fd);
-  return ntohs(address.sin_port);
 }
 
 struct Figures {
@@ -160,7 +147,7 @@ int main(int argc, char** argv) {
   server.Stop();
 
   // node_exporter on a free loopback port, scraped by the same client.
-  const int port = FreePort();
+  const int port = kova_test::FreePort();
   const std::string listen = "--web.listen-address=127.0.0.1:" + std::to_string(port);
   const pid_t exporter = fork();
   if (exporter == 0) {

@@ -5,9 +5,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <httplib.h>
-#include <netinet/in.h>
 #include <signal.h>
-#include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -26,6 +24,7 @@
 #include <vector>
 
 #include "test_support/collector_client.h"
+#include "test_support/free_port.h"
 #include "test_support/host_call.h"
 #include "test_support/test_root.h"
 
@@ -83,19 +82,6 @@ class Program {
  private:
   pid_t pid_ = -1;
 };
-
-// A loopback port free at this moment.
-int FreePort() {
-  const int fd = socket(AF_INET, SOCK_STREAM, 0);
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t length = sizeof(address);
-  bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof(address));
-  getsockname(fd, reinterpret_cast<sockaddr*>(&address), &length);
-  close(fd);
-  return ntohs(address.sin_port);
-}
 
 // The output of the shell command `command` and its exit status.
 std::string RunShell(const std::string& command, int& status) {
@@ -359,7 +345,7 @@ TEST(StatdMetrics, PrometheusScrapesTwoCollectors) {
   std::ofstream(config) << "global:\n  scrape_interval: 1s\n  scrape_timeout: 1s\n"
                         << "scrape_configs:\n  - job_name: kova\n    static_configs:\n"
                         << "      - targets: ['" << targets[0] << "', '" << targets[1] << "']\n";
-  const int port = FreePort();
+  const int port = kova_test::FreePort();
   Program prometheus({"prometheus", "--config.file=" + config,
                       "--storage.tsdb.path=" + prometheus_dir.Path("/data"),
                       "--web.listen-address=127.0.0.1:" + std::to_string(port)},

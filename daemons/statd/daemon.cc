@@ -5,6 +5,7 @@
 #include <syslog.h>
 
 #include <cmath>
+#include <cstring>
 #include <ctime>
 #include <memory>
 #include <set>
@@ -77,7 +78,7 @@ std::string DefaultDatabase() {
 bool ReadToken(const std::string& path, std::string& token, std::string& error) {
   std::string text;
   if (!kova::ReadWholeFile(path, text)) {
-    error = "can't read the token file " + path;
+    error = "can't read the token file " + path + ": " + strerror(errno);
     return false;
   }
   while (!text.empty() && (text.back() == '\n' || text.back() == '\r')) text.pop_back();

@@ -89,6 +89,7 @@ void ProcReader::ReadStat(Snapshot& snapshot, bool cpu_states) const {
     if (ReadAll(path, text) && ParseCpuLine(text.c_str(), cpu) &&
         ParseCpuStates(text.c_str(), snapshot.cpu_states)) {
       snapshot.cpu = cpu;
+      snapshot.boot_time = ParseBootTime(text.c_str());
       return;
     }
     snapshot.cpu_states.clear();

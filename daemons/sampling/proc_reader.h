@@ -106,6 +106,9 @@ struct MountPoint {
   uint32_t major = 0;
   uint32_t minor = 0;
   std::string path;
+  // Given defaults, so that a mount written as {major, minor, path} needs no more.
+  std::string source = {};  // the mount source after " - ", such as /dev/sda1
+  std::string fstype = {};  // the file system's type, such as ext4
 };
 
 // What a pass reads besides the "cpu" line of stat and MemTotal and
@@ -126,6 +129,7 @@ struct Snapshot {
   double seconds = 0;  // monotonic time of the pass
   std::optional<CpuTimes> cpu;
   std::vector<CpuStates> cpu_states;  // the line of all CPUs, then each online CPU's
+  uint64_t boot_time = 0;             // btime of stat, read with cpu_states; 0 when absent
   uint64_t memory_total_kib = 0;      // 0 when meminfo couldn't be read
   uint64_t memory_available_kib = 0;
   std::optional<MemoryDetail> memory_detail;

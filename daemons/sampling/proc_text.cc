@@ -68,6 +68,13 @@ bool ParseCpuLine(const char* text, CpuTimes& cpu) {
   return true;
 }
 
+uint64_t ParseBootTime(const char* text) {
+  for (const char* line = text; *line != '\0'; line = NextLine(line)) {
+    if (strncmp(line, "btime ", 6) == 0) return strtoull(line + 6, nullptr, 10);
+  }
+  return 0;
+}
+
 bool ParseCpuStates(const char* text, std::vector<CpuStates>& cpus) {
   cpus.clear();
   // The cpu lines come first, the line of all CPUs ahead of the others.
@@ -196,6 +203,17 @@ bool ParseMountLine(std::string_view line, MountPoint& mount) {
     return false;
   }
   mount.path = Unescape(fields[4]);
+  // Optional fields come next, up to a lone "-"; then the type and source.
+  const size_t separator = line.find(" - ", at > 0 ? at - 1 : 0);
+  if (separator != std::string_view::npos) {
+    std::string_view rest = line.substr(separator + 3);
+    const size_t blank = rest.find(' ');
+    mount.fstype = std::string(rest.substr(0, blank));
+    if (blank != std::string_view::npos) {
+      rest.remove_prefix(blank + 1);
+      mount.source = Unescape(rest.substr(0, rest.find(' ')));
+    }
+  }
   return true;
 }
 

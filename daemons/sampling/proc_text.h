@@ -19,6 +19,9 @@ bool ParseCpuLine(const char* text, CpuTimes& cpu);
 // Every cpu line of stat, the line of all CPUs first; false without that one.
 bool ParseCpuStates(const char* text, std::vector<CpuStates>& cpus);
 
+// The "btime" line of stat: the boot time in Unix seconds; 0 without one.
+uint64_t ParseBootTime(const char* text);
+
 // MemTotal and MemAvailable of meminfo; before kernel 3.14, which doesn't
 // write MemAvailable, MemFree + Buffers + Cached stands for it. False without
 // a MemTotal.
@@ -35,7 +38,8 @@ void ParseNetDev(const char* text, std::vector<NetSample>& interfaces);
 // A line of diskstats; with `detail`, reads and writes apart and the busy time too.
 bool ParseDiskLine(const char* line, bool detail, DiskSample& disk);
 
-// A line of mountinfo, its mount point's octal escapes (\040 for a blank) undone.
+// A line of mountinfo, its mount point's and source's octal escapes (\040 for
+// a blank) undone; the type and source are empty when the line lacks them.
 bool ParseMountLine(std::string_view line, MountPoint& mount);
 
 // A <pid>/stat file.

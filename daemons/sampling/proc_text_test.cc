@@ -37,6 +37,31 @@ TEST(ProcTextTest, CpuLinesStateByState) {
   }
 }
 
+TEST(ProcTextTest, MountLinesAndBootTime) {
+  const struct {
+    const char* line;
+    const char* path;  // nullptr: not a mountinfo line
+    const char* fstype;
+    const char* source;
+  } cases[] = {
+      {"40 22 253:0 / /volume\\0401 rw shared:1 - ext4 /dev/mapper/vg\\040a rw", "/volume 1",
+       "ext4", "/dev/mapper/vg a"},
+      {"41 22 0:50 / /run rw - tmpfs tmpfs rw,size=10m", "/run", "tmpfs", "tmpfs"},
+      {"42 22 8:1 / /old rw", "/old", "", ""},  // no type or source
+      {"43 22 x:1 / /bad rw - ext4 /dev/sdb1 rw", nullptr, "", ""},
+  };
+  for (const auto& c : cases) {
+    MountPoint mount;
+    ASSERT_EQ(ParseMountLine(c.line, mount), c.path != nullptr) << c.line;
+    if (c.path == nullptr) continue;
+    EXPECT_EQ(mount.path, c.path);
+    EXPECT_EQ(mount.fstype, c.fstype) << c.line;
+    EXPECT_EQ(mount.source, c.source) << c.line;
+  }
+  EXPECT_EQ(ParseBootTime("cpu  1 2 3 4\nintr 5\nbtime 1700000000\nprocesses 9\n"), 1700000000u);
+  EXPECT_EQ(ParseBootTime("cpu  1 2 3 4\n"), 0u);
+}
+
 TEST(ProcTextTest, NetDevLinesOfEveryKernel) {
   std::vector<NetSample> interfaces;
   ParseNetDev(

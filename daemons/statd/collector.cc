@@ -84,4 +84,9 @@ bool Collector::HistoryEnabled() const {
   return settings_.history.enabled;
 }
 
+Settings Collector::settings() const {
+  std::lock_guard lock(mutex_);
+  return settings_;
+}
+
 }  // namespace statd

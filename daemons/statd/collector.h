@@ -62,6 +62,8 @@ class Collector {
                 int64_t& now) const;
 
   bool HistoryEnabled() const;
+  // The settings of the last Reload that read them.
+  Settings settings() const;
   int interval() const { return interval_; }
   HistorySink& history() { return history_; }
 

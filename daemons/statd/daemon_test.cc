@@ -92,6 +92,8 @@ TEST(StatdProgram, RefusesABadCommandLine) {
       {{"--spool-max", "-1"}, "--spool-max -1"},
       {{"--proc", root.Path("/none")}, "not a directory"},
       {{"--database"}, "--database needs a value"},
+      {{"--metrics-listen", "nowhere:1"}, "--metrics-listen \"nowhere:1\" is not ADDRESS:PORT"},
+      {{"--metrics-token-file"}, "--metrics-token-file needs a value"},
       {{"--bogus"}, "unknown option --bogus"},
   };
   for (const auto& [args, says] : cases) {

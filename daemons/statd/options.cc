@@ -1,5 +1,7 @@
 #include "statd/options.h"
 
+#include "statd/metrics_server.h"
+
 #include <sys/stat.h>
 
 #include <cmath>
@@ -10,7 +12,8 @@ namespace statd {
 
 const char kUsage[] =
     "usage: kovastatd [--interval SECONDS] [--proc DIR] [--sys DIR] [--time-scale FACTOR]\n"
-    "                 [--database CONNINFO] [--spool-max MIB] [--log-stderr]\n"
+    "                 [--database CONNINFO] [--spool-max MIB] [--metrics-listen ADDR:PORT]\n"
+    "                 [--metrics-token-file PATH] [--log-stderr]\n"
     "Collects usage statistics as the service \"kovastatd\": every series sampled each\n"
     "interval, kept in memory for the real-time range and, while history is on, written\n"
     "to the history database once a minute. Answers on /run/kova/statd.sock. SIGHUP\n"
@@ -24,6 +27,10 @@ const char kUsage[] =
     "                       the service \"pgsql\", host=<root>/run/pgsql user=kova\n"
     "                       dbname=kova_history)\n"
     "  --spool-max MIB      how much may wait for the database, 1 to 4096 (default 64)\n"
+    "  --metrics-listen ADDR:PORT  serve GET /metrics for Prometheus there; empty: not\n"
+    "                       at all (default: statd_metrics_listen of the settings)\n"
+    "  --metrics-token-file PATH  a scrape must send \"Authorization: Bearer\" with the\n"
+    "                       token in PATH (default: statd_metrics_token_file)\n"
     "  --log-stderr         copy system-log lines to standard error\n";
 
 namespace {
@@ -55,8 +62,15 @@ bool ParseOptions(int argc, const char* const* argv, Options& options, std::stri
     }
     const size_t equals = arg.find('=');
     const std::string name(arg.substr(0, equals));
-    static const char* const kValued[] = {"--interval", "--proc",      "--sys", "--time-scale",
-                                          "--database", "--spool-max", nullptr};
+    static const char* const kValued[] = {"--interval",
+                                          "--proc",
+                                          "--sys",
+                                          "--time-scale",
+                                          "--database",
+                                          "--spool-max",
+                                          "--metrics-listen",
+                                          "--metrics-token-file",
+                                          nullptr};
     bool valued = false;
     for (const char* const* known = kValued; *known != nullptr; ++known) valued |= name == *known;
     if (!valued) {
@@ -81,6 +95,16 @@ bool ParseOptions(int argc, const char* const* argv, Options& options, std::stri
       (name == "--proc" ? options.proc_dir : options.sys_dir) = value;
     } else if (name == "--database") {
       options.database = value;
+    } else if (name == "--metrics-listen") {
+      std::string address;
+      uint16_t port = 0;
+      if (!value.empty() && !ParseListenAddress(value, address, port, error)) {
+        error = "--metrics-listen " + error;
+        return false;
+      }
+      options.metrics_listen = value;
+    } else if (name == "--metrics-token-file") {
+      options.metrics_token_file = value;
     } else if (name == "--interval") {
       if (!Number(value, 1, 60, number) || number != std::floor(number)) {
         error = "--interval " + value + ": not a whole number from 1 to 60";

@@ -4,6 +4,7 @@
 #define KOVA_DAEMONS_STATD_OPTIONS_H_
 
 #include <cstddef>
+#include <optional>
 #include <string>
 
 namespace statd {
@@ -15,6 +16,9 @@ struct Options {
   double time_scale = 1;  // real seconds per second of the collector's clock
   std::string database;   // libpq connection string; empty: the platform's "pgsql"
   size_t spool_max_bytes = size_t{64} << 20;
+  // The metrics endpoint's address and token file; unset: the settings file's.
+  std::optional<std::string> metrics_listen;
+  std::optional<std::string> metrics_token_file;
   bool log_to_stderr = false;
   bool help = false;
 };

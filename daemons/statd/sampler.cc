@@ -2,8 +2,11 @@
 
 #include <unistd.h>
 
+#include <algorithm>
+#include <cmath>
 #include <iterator>
 #include <optional>
+#include <string_view>
 #include <unordered_map>
 #include <unordered_set>
 
@@ -24,6 +27,34 @@ namespace {
 
 // How long a service's display name is taken as read before it is read again.
 constexpr double kDisplayNameSeconds = 60;
+// The services of packages are "pkgctl-<package>".
+constexpr std::string_view kPackagePrefix = "pkgctl-";
+
+const sampling::DiskSample* FindDisk(const sampling::Snapshot& snapshot, uint32_t major,
+                                     uint32_t minor) {
+  for (const sampling::DiskSample& disk : snapshot.disks) {
+    if (disk.major == major && disk.minor == minor) return &disk;
+  }
+  return nullptr;
+}
+
+// The system's counters of `now` for the metrics endpoint.
+void FillSystemMetrics(const sampling::Snapshot& now, MetricsSample& metrics) {
+  metrics.boot_time = now.boot_time;
+  metrics.cpus.clear();
+  for (const sampling::CpuStates& cpu : now.cpu_states) {
+    if (cpu.cpu >= 0) metrics.cpus.push_back(cpu);
+  }
+  metrics.memory_total_kib = now.memory_total_kib;
+  metrics.memory_available_kib = std::min(now.memory_available_kib, now.memory_total_kib);
+  metrics.memory = now.memory_detail;
+  metrics.load = now.load;
+  metrics.net = now.net;
+  metrics.disks.clear();
+  for (const sampling::DiskSample& disk : now.disks) {
+    if (disk.whole_disk) metrics.disks.push_back(disk);
+  }
+}
 
 class SystemSampler : public Sampler {
  public:
@@ -33,10 +64,13 @@ class SystemSampler : public Sampler {
         reader_(options.proc_dir, options.sys_dir),
         measurements_(static_cast<uint64_t>(sysconf(_SC_PAGESIZE)) / 1024),
         processes_(directory_),
-        volumes_(options.statvfs) {}
+        volumes_(options.statvfs) {
+    metrics_.ticks_per_second = static_cast<uint64_t>(sysconf(_SC_CLK_TCK));
+  }
 
   std::vector<SeriesValue> Cycle() override;
   const std::vector<std::string>& Unreadable() const override { return unreadable_; }
+  const MetricsSample& Metrics() const override { return metrics_; }
 
  private:
   struct DisplayName {
@@ -48,6 +82,8 @@ class SystemSampler : public Sampler {
   void AddServices(const std::vector<std::string>& services, std::vector<SeriesValue>& out);
   // The LUNs' values: I/O rate and latency of the device under each one's volume.
   void AddLuns(std::vector<SeriesValue>& out);
+  // The mount that holds the system path `path` in the current pass, nullptr when none does.
+  const sampling::MountPoint* MountOf(const std::string& path);
   // Forgets what was kept of services that are gone.
   void KeepOnly(const std::vector<std::string>& services);
 
@@ -62,6 +98,8 @@ class SystemSampler : public Sampler {
   std::unordered_map<std::string, DisplayName> display_names_;
   std::vector<std::string> unreadable_;
   size_t last_count_ = 0;  // values of the cycle before, to size the next one's
+  std::unordered_map<std::string, uint64_t> cpu_ticks_;  // per service, summed over the cycles
+  MetricsSample metrics_;
 };
 
 std::vector<SeriesValue> SystemSampler::Cycle() {
@@ -78,13 +116,18 @@ std::vector<SeriesValue> SystemSampler::Cycle() {
   directory_.Refresh();
   sampling::SampleNeeds needs;
   needs.processes = !services.empty();
-  needs.mounts = !directory_.luns().empty();
+  needs.mounts = !directory_.luns().empty() || !volumes.empty();
   needs.disks = needs.whole_disks = needs.disk_detail = true;
   needs.cpu_states = needs.load = needs.memory_detail = needs.net = true;
   sampling::Snapshot snapshot = reader_.Read(needs);
   if (clock_) snapshot.seconds = clock_();
   measurements_.Advance(std::move(snapshot));
   unreadable_ = measurements_.current().unreadable;
+  FillSystemMetrics(measurements_.current(), metrics_);
+  metrics_.services.clear();
+  metrics_.packages.clear();
+  metrics_.luns.clear();
+  metrics_.filesystems.clear();
 
   std::vector<SeriesValue> out;
   out.reserve(last_count_);
@@ -102,6 +145,15 @@ std::vector<SeriesValue> SystemSampler::Cycle() {
     AddValue(out, "volume.size", "B", volumes[i], labels, static_cast<double>(spaces[i]->size));
     AddValue(out, "volume.used", "B", volumes[i], labels, static_cast<double>(spaces[i]->used));
     AddValue(out, "volume.free", "B", volumes[i], labels, static_cast<double>(spaces[i]->free));
+    FilesystemSpace& space = metrics_.filesystems.emplace_back();
+    space.mountpoint = volumes[i];
+    if (const sampling::MountPoint* mount = MountOf(volumes[i])) {
+      space.device = mount->source;
+      space.fstype = mount->fstype;
+    }
+    space.size = spaces[i]->size;
+    space.free = spaces[i]->size - std::min(spaces[i]->used, spaces[i]->size);
+    space.avail = spaces[i]->free;
   }
   out.insert(out.end(), std::make_move_iterator(objects.begin()),
              std::make_move_iterator(objects.end()));
@@ -123,6 +175,15 @@ void SystemSampler::AddServices(const std::vector<std::string>& services,
     if (display.text.empty() || now - display.read_at >= kDisplayNameSeconds) {
       display = DisplayName{kova::ServiceDisplayName(name), now};
     }
+    // The reading's amount is 100 times the ticks the processes took in this cycle.
+    uint64_t& ticks = cpu_ticks_[name];
+    if (cpu.reading) ticks += static_cast<uint64_t>(std::llround(cpu.reading->amount / 100));
+    const bool package = name.compare(0, kPackagePrefix.size(), kPackagePrefix) == 0;
+    ServiceUsage& usage = (package ? metrics_.packages : metrics_.services).emplace_back();
+    usage.name = package ? name.substr(kPackagePrefix.size()) : name;
+    usage.display_name = display.text;
+    usage.cpu_seconds = static_cast<double>(ticks) / static_cast<double>(metrics_.ticks_per_second);
+    if (memory.reading) usage.resident_bytes = static_cast<uint64_t>(memory.reading->amount) * 1024;
     const Labels labels = {{"service", name}, {"display_name", display.text}};
     // No CPU share when no CPU time passed at all.
     if (cpu.reading && cpu.reading->base > 0) {
@@ -148,13 +209,26 @@ void SystemSampler::AddLuns(std::vector<SeriesValue>& out) {
     if (latency.reading && latency.reading->base > 0) {
       AddValue(out, "lun.latency", "ms", lun.uuid, labels, latency.reading->value());
     }
+    const std::optional<std::string> volume = directory_.LunVolume(lun.uuid);
+    const sampling::MountPoint* mount = volume && !volume->empty() ? MountOf(*volume) : nullptr;
+    const sampling::DiskSample* disk =
+        mount != nullptr ? FindDisk(measurements_.current(), mount->major, mount->minor) : nullptr;
+    if (disk == nullptr) continue;
+    metrics_.luns.push_back({lun.uuid, lun.name, disk->read_sectors * 512,
+                             disk->write_sectors * 512, disk->ios, disk->io_ms});
   }
+}
+
+const sampling::MountPoint* SystemSampler::MountOf(const std::string& path) {
+  const sampling::Snapshot& now = measurements_.current();
+  return now.mounts_read ? sampling::MountHolding(now.mounts, directory_.RealPath(path)) : nullptr;
 }
 
 void SystemSampler::KeepOnly(const std::vector<std::string>& services) {
   const std::unordered_set<std::string> names(services.begin(), services.end());
   processes_.KeepOnly(names);
   std::erase_if(display_names_, [&](const auto& entry) { return !names.count(entry.first); });
+  std::erase_if(cpu_ticks_, [&](const auto& entry) { return !names.count(entry.first); });
   services_ = services;
 }
 

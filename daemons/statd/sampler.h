@@ -14,6 +14,8 @@
 #include <utility>
 #include <vector>
 
+#include "statd/metrics_sample.h"
+
 namespace statd {
 
 // A series' labels, in the order the catalog shows them.
@@ -69,6 +71,11 @@ class Sampler {
   // cycle, a volume also while its statvfs hangs, so that the daemon can say
   // each once.
   virtual const std::vector<std::string>& Unreadable() const = 0;
+
+  // The raw counters of the last cycle for the metrics endpoint: everything
+  // but the time and kovaperfeventd's state, which the daemon adds. Services'
+  // CPU seconds add up the time measured in each cycle since the first.
+  virtual const MetricsSample& Metrics() const = 0;
 };
 
 // The sampler of the system under the system root (KOVA_ROOT): its services

@@ -28,7 +28,9 @@ bool ReadSettings(Settings& settings, std::string& error) {
   for (auto [key, value] : {std::pair{"resourcemonitor_realtime_max", &minutes},
                             std::pair{"resourcemonitor_history", &history},
                             std::pair{"resourcemonitor_history_minute_days", &minute_days},
-                            std::pair{"resourcemonitor_history_hour_days", &hour_days}}) {
+                            std::pair{"resourcemonitor_history_hour_days", &hour_days},
+                            std::pair{"statd_metrics_listen", &settings.metrics_listen},
+                            std::pair{"statd_metrics_token_file", &settings.metrics_token_file}}) {
     if (kova::ConfRead(path, key, *value) < 0) {
       error = "can't read " + path;
       return false;

@@ -18,7 +18,7 @@
 namespace {
 
 // Allocations of at least this many bytes can be made to fail: those of the
-// entries and their texts, not the small ones of the test's own machinery.
+// entries and the read's block, not the small ones of the test's own machinery.
 constexpr size_t kLarge = 64 * 1024;
 // How many more large allocations succeed before every one fails; negative
 // for no failure.
@@ -62,8 +62,8 @@ int OpenDescriptors() {
 // with no entries, and the log's copy is closed and deleted.
 TEST(LogAllocationTest, AFailedAllocationAnywhereInTheReadAnswersNoEntries) {
   kova_fake::Reset();
-  // About 3 MB in no order of time: several blocks of texts, and a sort that
-  // can't just turn the entries round.
+  // About 3 MB in no order of time: many read blocks, and a sort that can't
+  // just turn the entries round.
   constexpr unsigned kLines = 3000;
   std::vector<std::string> lines;
   for (unsigned i = 0; i < kLines; ++i) {
@@ -91,8 +91,8 @@ TEST(LogAllocationTest, AFailedAllocationAnywhereInTheReadAnswersNoEntries) {
     EXPECT_EQ(response.GetData()["total"], Json::Value(Json::UInt(0))) << succeeding;
     EXPECT_EQ(response.GetData()["logs"], Json::Value(Json::arrayValue)) << succeeding;
   }
-  // At least the records' room, a block of texts and the sort's keys failed.
-  EXPECT_GE(failed, 3);
+  // At least the entries' room and the read's block failed.
+  EXPECT_GE(failed, 2);
 }
 
 }  // namespace

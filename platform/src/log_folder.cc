@@ -6,6 +6,7 @@
 #include <stdio.h>
 #include <stdlib.h>
 #include <sys/file.h>
+#include <sys/sendfile.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -157,17 +158,22 @@ int64_t CountLines(int fd, off_t end) {
 // can, through a buffer where it can't (a pipe, another file system).
 bool CopyRange(int in, off_t size, int out) {
   off_t at = 0;
-  while (at < size) {
-    const ssize_t copied =
-        copy_file_range(in, &at, out, nullptr, static_cast<size_t>(size - at), 0);
-    if (copied > 0) continue;
-    if (copied < 0 && errno == EINTR) continue;
-    if (copied == 0) return true;  // the segment shrank: what is there is copied
-    if (errno != EXDEV && errno != EINVAL && errno != ENOSYS && errno != EOPNOTSUPP &&
-        errno != EBADF) {
-      return false;
+  // In the kernel: within a file system, then to any file (another file system,
+  // a pipe); through a buffer where neither can.
+  for (const bool same_file_system : {true, false}) {
+    while (at < size) {
+      const size_t left = static_cast<size_t>(size - at);
+      const ssize_t copied = same_file_system ? copy_file_range(in, &at, out, nullptr, left, 0)
+                                              : sendfile(out, in, &at, left);
+      if (copied > 0) continue;
+      if (copied < 0 && errno == EINTR) continue;
+      if (copied == 0) return true;  // the segment shrank: what is there is copied
+      if (errno != EXDEV && errno != EINVAL && errno != ENOSYS && errno != EOPNOTSUPP &&
+          errno != EBADF) {
+        return false;
+      }
+      break;
     }
-    break;
   }
   const std::unique_ptr<char[]> buffer(new char[kCopyBufferSize]);
   while (at < size) {

@@ -18,7 +18,7 @@
 namespace {
 
 // Allocations of at least this many bytes can be made to fail: those of the
-// entries and the read's block, not the small ones of the test's own machinery.
+// entries and the sort, not the small ones of the test's own machinery.
 constexpr size_t kLarge = 64 * 1024;
 // How many more large allocations succeed before every one fails; negative
 // for no failure.
@@ -62,13 +62,13 @@ int OpenDescriptors() {
 // with no entries, and the log's copy is closed and deleted.
 TEST(LogAllocationTest, AFailedAllocationAnywhereInTheReadAnswersNoEntries) {
   kova_fake::Reset();
-  // About 3 MB in no order of time: many read blocks, and a sort that can't
-  // just turn the entries round.
-  constexpr unsigned kLines = 3000;
+  // About 3 MB in no order of time: a sort that can't just turn the entries
+  // round, with a buffer as large as the entries.
+  constexpr unsigned kLines = 6000;
   std::vector<std::string> lines;
   for (unsigned i = 0; i < kLines; ++i) {
     lines.push_back("1\tWarning\t" + KOVALogConvertTime1(1700000000 + (i * 7919) % kLines) +
-                    "\tadmin\tkovaperfeventd\t" + std::string(1000, 'e'));
+                    "\tadmin\tkovaperfeventd\t" + std::string(500, 'e'));
   }
   kova_fake::SetLogLines(lines);
   const int descriptors = OpenDescriptors();
@@ -91,7 +91,7 @@ TEST(LogAllocationTest, AFailedAllocationAnywhereInTheReadAnswersNoEntries) {
     EXPECT_EQ(response.GetData()["total"], Json::Value(Json::UInt(0))) << succeeding;
     EXPECT_EQ(response.GetData()["logs"], Json::Value(Json::arrayValue)) << succeeding;
   }
-  // At least the entries' room and the read's block failed.
+  // At least the entries' room and the sort's buffer failed.
   EXPECT_GE(failed, 2);
 }
 

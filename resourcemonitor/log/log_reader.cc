@@ -2,6 +2,7 @@
 
 #include <errno.h>
 #include <fcntl.h>
+#include <sys/mman.h>
 #include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -193,76 +194,92 @@ class CloseOnExit {
   int fd_;
 };
 
-// Hands out the pieces of a file that fgets into a buffer of kLineBufferSize
-// bytes would: up to and including a line feed, at most kLineBufferSize - 1
-// bytes. The file is read in large blocks, and each piece copied out of them.
+// Hands out the pieces of the log's mapped copy that fgets into a buffer of
+// kLineBufferSize bytes would: up to and including a line feed, at most
+// kLineBufferSize - 1 bytes, each copied into the caller's buffer. Pages read
+// are let go every few MiB, so that a large copy is never resident whole.
 class PieceReader {
  public:
-  explicit PieceReader(int fd) : fd_(fd), block_(std::make_unique<char[]>(kBlockSize)) {}
+  explicit PieceReader(std::string_view text) : text_(text) {}
+  ~PieceReader() { Release(text_.size()); }
+  PieceReader(const PieceReader&) = delete;
+  PieceReader& operator=(const PieceReader&) = delete;
 
-  // Copies the next piece into `line` and ends it with a NUL, with its size and
-  // its offset in the file. False at the end of the file or on a read error.
-  bool Next(char (&line)[kLineBufferSize], size_t& size, uint64_t& offset) {
-    for (;;) {
-      const char* start = block_.get() + begin_;
-      const size_t available = end_ - begin_;
-      const size_t window = std::min(available, kLineBufferSize - 1);
-      const void* newline = memchr(start, '\n', window);
-      if (newline != nullptr || window == kLineBufferSize - 1 || (at_end_ && available > 0)) {
-        size = newline != nullptr ? static_cast<const char*>(newline) - start + 1 : window;
-        memcpy(line, start, size);
-        line[size] = '\0';
-        offset = block_offset_ + begin_;
-        begin_ += size;
-        return true;
-      }
-      if (at_end_ || !Fill()) return false;
-    }
-  }
-
- private:
-  static constexpr size_t kBlockSize = 1 << 16;
-
-  // Moves the unread bytes to the front of the block and reads more after them.
-  bool Fill() {
-    memmove(block_.get(), block_.get() + begin_, end_ - begin_);
-    block_offset_ += begin_;
-    end_ -= begin_;
-    begin_ = 0;
-    ssize_t got;
-    while ((got = read(fd_, block_.get() + end_, kBlockSize - end_)) < 0 && errno == EINTR) {
-    }
-    if (got < 0) return false;
-    at_end_ = got == 0;
-    end_ += static_cast<size_t>(got);
+  // Copies the next piece into `line` and ends it with a NUL, with its size,
+  // its offset in the copy, and whether it holds a NUL of its own. False at
+  // the end of the copy.
+  bool Next(char (&line)[kLineBufferSize], size_t& size, size_t& offset, bool& has_nul) {
+    if (at_ == text_.size()) return false;
+    const char* start = text_.data() + at_;
+    const size_t window = std::min(text_.size() - at_, kLineBufferSize - 1);
+    const void* newline = memchr(start, '\n', window);
+    size = newline != nullptr ? static_cast<const char*>(newline) - start + 1 : window;
+    memcpy(line, start, size);
+    line[size] = '\0';
+    offset = at_;
+    has_nul = HasNul(at_, at_ + size);
+    at_ += size;
+    if (at_ - released_ >= kReleaseEvery) Release(at_);
     return true;
   }
 
-  int fd_;
-  std::unique_ptr<char[]> block_;
-  size_t begin_ = 0;
-  size_t end_ = 0;
-  uint64_t block_offset_ = 0;  // of the block's first byte in the file
-  bool at_end_ = false;
+ private:
+  static constexpr size_t kReleaseEvery = 8 << 20;
+  static constexpr size_t kNulScan = 1 << 20;
+
+  // Whether bytes [begin, end) hold a NUL. The copy is searched ahead a chunk
+  // at a time, each byte once, so that pieces without one need no strlen.
+  bool HasNul(size_t begin, size_t end) {
+    for (;;) {
+      if (nul_ < begin) {  // passed: look again from here
+        scanned_ = begin;
+        nul_ = std::string_view::npos;
+      }
+      if (nul_ != std::string_view::npos) return nul_ < end;
+      if (scanned_ >= end) return false;
+      const size_t until = std::min(text_.size(), std::max(end, scanned_ + kNulScan));
+      const void* found = memchr(text_.data() + scanned_, '\0', until - scanned_);
+      if (found != nullptr)
+        nul_ = static_cast<size_t>(static_cast<const char*>(found) - text_.data());
+      scanned_ = until;
+    }
+  }
+
+  // Lets go of the whole pages before `offset`; they come back if read again.
+  void Release(size_t offset) {
+    static const size_t page = static_cast<size_t>(sysconf(_SC_PAGESIZE));
+    const size_t until = offset / page * page;
+    if (until <= released_) return;
+    madvise(const_cast<char*>(text_.data()) + released_, until - released_, MADV_DONTNEED);
+    released_ = until;
+  }
+
+  std::string_view text_;
+  size_t at_ = 0;
+  size_t released_ = 0;
+  size_t scanned_ = 0;
+  size_t nul_ = std::string_view::npos;
 };
 
 // Parses the log's copy at `name` and adds the entries that pass `tests`, which
-// then lie in the copy, mapped. A copy that can't be opened reads as empty.
-// False when the copy can't be mapped.
+// lie in the copy, mapped. A copy that can't be opened reads as empty. False
+// when the copy can't be mapped.
 bool ReadLogCopy(const char* name, const LineTests& tests, LogRecords& records) {
   const int fd = open(name, O_RDONLY | O_CLOEXEC);
   if (fd < 0) return true;
   const CloseOnExit close_copy(fd);
   struct stat info;
   if (fstat(fd, &info) != 0) return true;
+  if (!records.MapText(fd, static_cast<size_t>(info.st_size))) return false;
   // Room for as many entries as lines of a typical length fit in the copy.
   records.Reserve(static_cast<size_t>(info.st_size) / 96);
-  PieceReader reader(fd);
+  PieceReader reader(records.text());
   char line[kLineBufferSize];
   size_t size;
-  uint64_t offset;
-  while (reader.Next(line, size, offset)) {
-    size_t length = strlen(line);
+  size_t offset;
+  bool has_nul;
+  while (reader.Next(line, size, offset, has_nul)) {
+    size_t length = has_nul ? strlen(line) : size;
     if (length > 0 && line[length - 1] == '\n') line[--length] = '\0';
     LogLine fields;
     if (!SplitLine(line, length, fields)) {
@@ -271,10 +288,6 @@ bool ReadLogCopy(const char* name, const LineTests& tests, LogRecords& records) 
       continue;
     }
     if (tests.Pass(fields)) records.Add(offset, length, fields.time);
-  }
-  if (records.size() > 0 && !records.MapText(fd, static_cast<size_t>(info.st_size))) {
-    records.Clear();
-    return false;
   }
   return true;
 }

@@ -79,6 +79,8 @@ class LogRecords {
   void Sort(const LogCompare& compare);
 
   size_t size() const { return entries_.size(); }
+  // The text the entries lie in.
+  std::string_view text() const { return text_; }
   // The texts of entry `index`.
   LogFields Fields(size_t index) const;
   // Entry `index` as a JSON log entry {"event", "level", "time"}.
@@ -92,6 +94,7 @@ class LogRecords {
   std::string_view Line(const Place& place) const;
 
   std::vector<Place> entries_;
+  size_t unpacked_ = 0;   // entries whose time isn't in the log's shape
   std::string own_text_;  // the text of AddLine
   void* mapping_ = nullptr;
   size_t mapping_size_ = 0;

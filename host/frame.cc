@@ -9,6 +9,8 @@
 #include <cstdint>
 #include <cstring>
 
+#include "host/passed_fds.h"
+
 namespace kova_host {
 namespace {
 
@@ -41,15 +43,7 @@ IoResult WriteAll(int fd, iovec* parts, size_t count, Clock::time_point deadline
     msghdr message{};
     message.msg_iov = parts;
     message.msg_iovlen = count;
-    if (attached >= 0) {
-      message.msg_control = control;
-      message.msg_controllen = sizeof(control);
-      cmsghdr* header = CMSG_FIRSTHDR(&message);
-      header->cmsg_level = SOL_SOCKET;
-      header->cmsg_type = SCM_RIGHTS;
-      header->cmsg_len = CMSG_LEN(sizeof(int));
-      memcpy(CMSG_DATA(header), &attached, sizeof(int));
-    }
+    if (attached >= 0) AttachDescriptors(message, &attached, 1, control, sizeof(control));
     ssize_t sent = sendmsg(fd, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
     if (sent > 0) attached = -1;  // it went with the bytes sent
     if (sent < 0) {
@@ -123,7 +117,9 @@ IoResult FrameReader::Fill(size_t size, Clock::time_point deadline) {
     message.msg_controllen = sizeof(control);
     const ssize_t got =
         recvmsg(fd_, &message, MSG_CMSG_CLOEXEC | (deadline == kNoDeadline ? 0 : MSG_DONTWAIT));
-    if (got >= 0) Keep(message);
+    if (got >= 0) {
+      for (UniqueFd& passed : PassedDescriptors(message)) descriptors_.push_back(std::move(passed));
+    }
     if (got > 0) {
       end_ += static_cast<size_t>(got);
       continue;
@@ -132,19 +128,6 @@ IoResult FrameReader::Fill(size_t size, Clock::time_point deadline) {
     if (errno != EAGAIN && errno != EINTR) return IoResult::kError;
   }
   return IoResult::kOk;
-}
-
-void FrameReader::Keep(msghdr& message) {
-  for (cmsghdr* header = CMSG_FIRSTHDR(&message); header != nullptr;
-       header = CMSG_NXTHDR(&message, header)) {
-    if (header->cmsg_level != SOL_SOCKET || header->cmsg_type != SCM_RIGHTS) continue;
-    const size_t count = (header->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-    for (size_t i = 0; i < count; ++i) {
-      int passed;
-      memcpy(&passed, CMSG_DATA(header) + i * sizeof(int), sizeof(int));
-      descriptors_.emplace_back(passed);
-    }
-  }
 }
 
 UniqueFd FrameReader::TakeDescriptor() {

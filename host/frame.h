@@ -58,8 +58,6 @@ class FrameReader {
  private:
   // Reads until `size` unread bytes are buffered.
   IoResult Fill(size_t size, Clock::time_point deadline);
-  // Keeps the descriptors that came with `message`.
-  void Keep(msghdr& message);
 
   static constexpr size_t kReadSize = 65536;            // asked of each read at least
   static constexpr size_t kKeptSize = size_t{1} << 20;  // room kept between frames

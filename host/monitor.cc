@@ -9,10 +9,12 @@
 
 #include <algorithm>
 #include <cstring>
+#include <vector>
 
 #include "host/host_log.h"
 #include "host/json_text.h"
 #include "host/module_loader.h"
+#include "host/passed_fds.h"
 #include "host/private_tmp.h"
 #include "host/taken_count.h"
 #include "src/accounts.h"
@@ -36,15 +38,7 @@ bool Send(int socket, const Json::Value& message, std::initializer_list<int> fds
   header.msg_iov = &data;
   header.msg_iovlen = 1;
   alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * kMaxPassed)] = {};
-  if (fds.size() > 0 && fds.size() <= kMaxPassed) {
-    header.msg_control = control;
-    header.msg_controllen = CMSG_SPACE(sizeof(int) * fds.size());
-    cmsghdr* attached = CMSG_FIRSTHDR(&header);
-    attached->cmsg_level = SOL_SOCKET;
-    attached->cmsg_type = SCM_RIGHTS;
-    attached->cmsg_len = CMSG_LEN(sizeof(int) * fds.size());
-    memcpy(CMSG_DATA(attached), fds.begin(), sizeof(int) * fds.size());
-  }
+  AttachDescriptors(header, fds.begin(), fds.size(), control, sizeof(control));
   ssize_t sent;
   do {
     sent = sendmsg(socket, &header, MSG_NOSIGNAL);
@@ -70,21 +64,8 @@ int Receive(int socket, Json::Value& message, int* fds = nullptr, size_t count =
   } while (got < 0 && errno == EINTR);
   if (got <= 0) return got == 0 ? 0 : -1;
   std::fill(fds, fds + count, -1);
-  size_t taken = 0;
-  for (cmsghdr* attached = CMSG_FIRSTHDR(&header); attached != nullptr;
-       attached = CMSG_NXTHDR(&header, attached)) {
-    if (attached->cmsg_level != SOL_SOCKET || attached->cmsg_type != SCM_RIGHTS) continue;
-    const size_t passed_count = (attached->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-    for (size_t i = 0; i < passed_count; ++i) {
-      int passed;
-      memcpy(&passed, CMSG_DATA(attached) + i * sizeof(int), sizeof(int));
-      if (taken < count) {
-        fds[taken++] = passed;
-      } else {
-        close(passed);
-      }
-    }
-  }
+  std::vector<UniqueFd> passed = PassedDescriptors(header);  // those not taken close
+  for (size_t i = 0; i < count && i < passed.size(); ++i) fds[i] = passed[i].Release();
   text.resize(static_cast<size_t>(got));
   const bool ok = (header.msg_flags & (MSG_TRUNC | MSG_CTRUNC)) == 0 && FromJson(text, message) &&
                   message.isObject();

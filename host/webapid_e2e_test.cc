@@ -103,6 +103,17 @@ class WebApidTest : public ::testing::Test {
     return host_->Sid(account, password);
   }
 
+  // The host started with the test module, signed in, and the descriptors its
+  // front-end and the module's runner hold once the calls' connections closed.
+  struct Idle {
+    std::string sid;
+    pid_t runner = -1;
+    pid_t front_end = -1;
+    size_t front_fds = 0;
+    size_t runner_fds = 0;
+  };
+  Idle StartWithTestModule(const std::vector<std::string>& args = {});
+
   kova_test::TestRoot root_;
   std::unique_ptr<kova_test::WebApid> host_;
 };
@@ -443,17 +454,24 @@ std::string BigForm(uint64_t size, const std::string& sid) {
                {"_sid", sid}});
 }
 
-TEST_F(WebApidTest, RawOutputOfAnySizeArrivesWholeAndItsFileIsClosed) {
+WebApidTest::Idle WebApidTest::StartWithTestModule(const std::vector<std::string>& args) {
   AddModule(KOVA_CRASH_MODULE_PATH);
-  Start();
-  const std::string sid = Sid("admin", kAdminPassword);
-  const Json::Value runner = Call("KOVA.Test.Crash", "echo", {}, sid).json["data"]["pid"];
-  ASSERT_TRUE(runner.isInt());
-  const pid_t front_end = FrontEnd(host_->pid());
-  ASSERT_GT(front_end, 0);
+  Start(args);
+  Idle idle;
+  idle.sid = Sid("admin", kAdminPassword);
+  const Json::Value runner = Call("KOVA.Test.Crash", "echo", {}, idle.sid).json["data"]["pid"];
+  idle.runner = runner.isInt() ? runner.asInt() : -1;
+  idle.front_end = FrontEnd(host_->pid());
   std::this_thread::sleep_for(std::chrono::milliseconds(300));  // the calls' connections close
-  const size_t front_fds = OpenDescriptors(front_end);
-  const size_t runner_fds = OpenDescriptors(runner.asInt());
+  if (idle.front_end > 0) idle.front_fds = OpenDescriptors(idle.front_end);
+  if (idle.runner > 0) idle.runner_fds = OpenDescriptors(idle.runner);
+  return idle;
+}
+
+TEST_F(WebApidTest, RawOutputOfAnySizeArrivesWholeAndItsFileIsClosed) {
+  const auto [sid, runner, front_end, front_fds, runner_fds] = StartWithTestModule();
+  ASSERT_GT(runner, 0);
+  ASSERT_GT(front_end, 0);
 
   // Either side of what travels inline (64 KiB with the headers), either side
   // of one part sent from the file, and more than any buffer on the way.
@@ -475,21 +493,15 @@ TEST_F(WebApidTest, RawOutputOfAnySizeArrivesWholeAndItsFileIsClosed) {
   EXPECT_TRUE(head->body.empty());
 
   EXPECT_EQ(SettledDescriptors(front_end, front_fds), front_fds);
-  EXPECT_EQ(OpenDescriptors(runner.asInt()), runner_fds);
+  EXPECT_EQ(OpenDescriptors(runner), runner_fds);
   EXPECT_EQ(Call("KOVA.Test.Crash", "echo", {}, sid).json["data"]["pid"], runner);
 }
 
 TEST_F(WebApidTest, ADownloadDroppedOrNoLongerTakenIsClosedAndOthersGoOn) {
-  AddModule(KOVA_CRASH_MODULE_PATH);
-  Start({"--send-timeout", "4"});
-  const std::string sid = Sid("admin", kAdminPassword);
-  const Json::Value runner = Call("KOVA.Test.Crash", "echo", {}, sid).json["data"]["pid"];
-  ASSERT_TRUE(runner.isInt());
-  const pid_t front_end = FrontEnd(host_->pid());
+  const auto [sid, runner, front_end, front_fds, runner_fds] =
+      StartWithTestModule({"--send-timeout", "4"});
+  ASSERT_GT(runner, 0);
   ASSERT_GT(front_end, 0);
-  std::this_thread::sleep_for(std::chrono::milliseconds(300));  // the calls' connections close
-  const size_t front_fds = OpenDescriptors(front_end);
-  const size_t runner_fds = OpenDescriptors(runner.asInt());
   const std::string request =
       "GET /webapi/entry.cgi?" + BigForm(20000000, sid) + " HTTP/1.1\r\nHost: x\r\n\r\n";
   const struct {
@@ -516,7 +528,7 @@ TEST_F(WebApidTest, ADownloadDroppedOrNoLongerTakenIsClosedAndOthersGoOn) {
       EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::seconds(2)) << c.what;
     }
   }
-  EXPECT_EQ(OpenDescriptors(runner.asInt()), runner_fds);
+  EXPECT_EQ(OpenDescriptors(runner), runner_fds);
   const Reply again = Send("GET", BigForm(3000000, sid), {});
   EXPECT_EQ(FirstDifference(again.body), 3000000u);
 }

@@ -22,6 +22,7 @@
 #include "src/file_cache.h"
 #include "src/lun_registry.h"
 #include "test_support/host_call.h"
+#include "test_support/perfevent_rule.h"
 #include "test_support/temp_root.h"
 
 namespace {
@@ -56,12 +57,8 @@ bool FillRoot(const std::string& root) {
                   "\"\n");
   }
   // One rule through the platform makes the store; the rest go in one transaction.
-  KOVAPERFEVENT_CONF_SETTING first{};
-  snprintf(first.service, sizeof(first.service), "lun-0");
-  first.type = PERFEVENT_TYPE_ISCSI_LUN;
-  first.preset_a = 5;
-  first.preset_b = 30;
-  first.enable = 1;
+  KOVAPERFEVENT_CONF_SETTING first =
+      kova_test::PerfEventRule(PERFEVENT_TYPE_ISCSI_LUN, "lun-0", 0, 0, 0);
   if (KOVAPerfEventConfAdd(&first) != 0) return false;
   sqlite3* db = nullptr;
   if (sqlite3_open((root + "/var/lib/kova/perfevent/rules.db").c_str(), &db) != SQLITE_OK) {

@@ -28,6 +28,7 @@
 #include "kova/perfevent.h"
 #include "test_support/free_port.h"
 #include "test_support/perfevent_log.h"
+#include "test_support/perfevent_rule.h"
 #include "test_support/recorded_proc.h"
 #include "test_support/test_root.h"
 
@@ -149,15 +150,8 @@ class AlertsE2eTest : public ::testing::Test {
 
   std::string AddRule(int32_t type, const char* object, int32_t resource, int32_t severity,
                       int32_t threshold) {
-    KOVAPERFEVENT_CONF_SETTING rule{};
-    rule.type = static_cast<KOVAPERFEVENT_EVENT_TYPE>(type);
-    snprintf(rule.service, sizeof(rule.service), "%s", object);
-    rule.resource = resource;
-    rule.severity = severity;
-    rule.threshold = threshold;
-    rule.preset_a = 5;
-    rule.preset_b = 30;
-    rule.enable = 1;
+    KOVAPERFEVENT_CONF_SETTING rule = kova_test::PerfEventRule(
+        static_cast<KOVAPERFEVENT_EVENT_TYPE>(type), object, resource, severity, threshold);
     EXPECT_EQ(KOVAPerfEventConfAdd(&rule), 0);
     return rule.id;
   }

@@ -6,23 +6,12 @@
 
 #include "kova/error.h"
 #include "kova/perfevent.h"
+#include "test_support/perfevent_rule.h"
 #include "test_support/test_root.h"
 
 namespace {
 
-KOVAPERFEVENT_CONF_SETTING Rule(KOVAPERFEVENT_EVENT_TYPE type, const char* service,
-                                int32_t resource, int32_t severity, int32_t threshold = 80) {
-  KOVAPERFEVENT_CONF_SETTING rule{};
-  rule.type = type;
-  snprintf(rule.service, sizeof(rule.service), "%s", service);
-  rule.resource = resource;
-  rule.severity = severity;
-  rule.threshold = threshold;
-  rule.preset_a = 5;
-  rule.preset_b = 30;
-  rule.enable = 1;
-  return rule;
-}
+using kova_test::PerfEventRule;
 
 // The ids and objects of all rules, in list order.
 std::vector<std::string> Listed() {
@@ -41,15 +30,15 @@ TEST(RuleStoreTest, AssignsIdsThatAreNeverReusedAndListsInCreationOrder) {
   EXPECT_EQ(Listed(), std::vector<std::string>());  // no store yet: an empty list
   EXPECT_EQ(KOVAPerfEventConfListGet("1"), nullptr);
   for (const char* service : {"smb", "nfs", "web"}) {
-    KOVAPERFEVENT_CONF_SETTING rule =
-        Rule(PERFEVENT_TYPE_SERVICE, service, PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_WARNING);
+    KOVAPERFEVENT_CONF_SETTING rule = PerfEventRule(
+        PERFEVENT_TYPE_SERVICE, service, PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_WARNING);
     ASSERT_EQ(KOVAPerfEventConfAdd(&rule), 0);
   }
   EXPECT_EQ(Listed(), (std::vector<std::string>{"1:smb", "2:nfs", "3:web"}));
   ASSERT_EQ(KOVAPerfEventConfDelete("2"), 0);
   EXPECT_EQ(KOVAPerfEventConfDelete("2"), -1);
   KOVAPERFEVENT_CONF_SETTING added =
-      Rule(PERFEVENT_TYPE_ISCSI_LUN, "lun-uuid", PERFEVENT_RESOURCE_IO_RATE, 2, 5000);
+      PerfEventRule(PERFEVENT_TYPE_ISCSI_LUN, "lun-uuid", PERFEVENT_RESOURCE_IO_RATE, 2, 5000);
   ASSERT_EQ(KOVAPerfEventConfAdd(&added), 0);
   EXPECT_STREQ(added.id, "4");
   EXPECT_EQ(Listed(), (std::vector<std::string>{"1:smb", "3:web", "4:lun-uuid"}));
@@ -63,8 +52,8 @@ TEST(RuleStoreTest, AssignsIdsThatAreNeverReusedAndListsInCreationOrder) {
 
 TEST(RuleStoreTest, ChangesARecordOfAListInPlace) {
   kova_test::TestRoot root;
-  KOVAPERFEVENT_CONF_SETTING rule =
-      Rule(PERFEVENT_TYPE_SYSTEM, "", PERFEVENT_RESOURCE_MEMORY, PERFEVENT_SEVERITY_CRITICAL);
+  KOVAPERFEVENT_CONF_SETTING rule = PerfEventRule(
+      PERFEVENT_TYPE_SYSTEM, "", PERFEVENT_RESOURCE_MEMORY, PERFEVENT_SEVERITY_CRITICAL);
   ASSERT_EQ(KOVAPerfEventConfAdd(&rule), 0);
   KovaPerfEventConfSettingNode* list = KOVAPerfEventConfListGet(rule.id);
   ASSERT_NE(list, nullptr);
@@ -91,10 +80,10 @@ TEST(RuleStoreTest, ChangesARecordOfAListInPlace) {
 
 TEST(RuleStoreTest, RefusesDuplicatesOfObjectResourceAndSeverity) {
   kova_test::TestRoot root;
-  KOVAPERFEVENT_CONF_SETTING first =
-      Rule(PERFEVENT_TYPE_SERVICE, "smb", PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_WARNING, 80);
-  KOVAPERFEVENT_CONF_SETTING critical =
-      Rule(PERFEVENT_TYPE_SERVICE, "smb", PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_CRITICAL, 95);
+  KOVAPERFEVENT_CONF_SETTING first = PerfEventRule(
+      PERFEVENT_TYPE_SERVICE, "smb", PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_WARNING, 80);
+  KOVAPERFEVENT_CONF_SETTING critical = PerfEventRule(
+      PERFEVENT_TYPE_SERVICE, "smb", PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_CRITICAL, 95);
   ASSERT_EQ(KOVAPerfEventConfAdd(&first), 0);
   ASSERT_EQ(KOVAPerfEventConfAdd(&critical), 0);
 
@@ -141,12 +130,12 @@ TEST(RuleStoreTest, KeepsRulesTheDaemonCannotMeasureAndRefusesNonRecords) {
   };
   // Each kept rule gets a service text of its own, so none repeats another.
   int service = 0;
-  KOVAPERFEVENT_CONF_SETTING stored =
-      Rule(PERFEVENT_TYPE_SERVICE, "base", PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_WARNING);
+  KOVAPERFEVENT_CONF_SETTING stored = PerfEventRule(
+      PERFEVENT_TYPE_SERVICE, "base", PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_WARNING);
   ASSERT_EQ(KOVAPerfEventConfAdd(&stored), 0);
   for (const auto& c : cases) {
-    KOVAPERFEVENT_CONF_SETTING rule =
-        Rule(PERFEVENT_TYPE_SERVICE, "", PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_WARNING);
+    KOVAPERFEVENT_CONF_SETTING rule = PerfEventRule(
+        PERFEVENT_TYPE_SERVICE, "", PERFEVENT_RESOURCE_CPU, PERFEVENT_SEVERITY_WARNING);
     snprintf(rule.service, sizeof(rule.service), "s%d", ++service);
     c.change(rule);
     KOVAPERFEVENT_CONF_SETTING added = rule;
